@@ -1,0 +1,3 @@
+#include "core/daemon_state.h"
+
+log_daemon_state g_daemon;

@@ -1,0 +1,25 @@
+/*
+ * The daemon's process-wide state: everything that is true of the daemon as a whole and of no single
+ * connection. Start-up writes it before it starts the first thread; afterwards only what is atomic changes.
+ * Connections are in core/log_registry.h.
+ */
+#ifndef CORE_DAEMON_STATE_H
+#define CORE_DAEMON_STATE_H
+
+#include <atomic>
+#include <openssl/ossl_typ.h>
+
+struct log_daemon_state {
+    int run_mode = 0;     /* 0 server mode, any other value client mode */
+    int retry_count = 10; /* largest number of connect tries in client mode */
+    int use_ssl = 0;      /* 1 when client mode runs over TLS: every read and write chooses by it */
+    /* Writes on a TLS session as SSL_write() does. Set with use_ssl by whoever brings TLS along: server mode
+     * has no use for a TLS library and the memory it takes, so nothing below the client's room is linked with
+     * one. */
+    int (*ssl_write)(SSL *ssl, const void *bytes, int len) = nullptr;
+    std::atomic<int> exit_flag{0}; /* set to 1 to end the process; start-up looks at it every 5 seconds */
+};
+
+extern log_daemon_state g_daemon;
+
+#endif

@@ -1,0 +1,78 @@
+#include "core/log_options.h"
+
+#include "core/daemon_state.h"
+#include "core/log_line.h"
+#include "core/log_tools.h"
+
+#include <cstdio>
+#include <cstring>
+#include <getopt.h>
+
+namespace
+{
+
+constexpr char kLogSource[] = "vex_log_manage";
+
+constexpr std::size_t kArgumentMax = 63; /* characters: readers of these items have 64 bytes for them */
+
+/* An argument that could not be read back whole changes nothing. */
+void refuse(const char *option, const char *argument)
+{
+    LOG_NOTE("%s: argument of %zu characters refused, %zu is the most\n", option, std::strlen(argument), kArgumentMax);
+    std::fprintf(stderr, "%s: the argument is longer than %zu characters, ignored\n", option, kArgumentMax);
+}
+
+void set_address(const char *address)
+{
+    if (std::strlen(address) > kArgumentMax) {
+        refuse("--address", address);
+        return;
+    }
+    vex_set_nv_item("log_manage_mode", "1", 1);
+    vex_set_nv_item("log_server_addr", address, static_cast<int>(std::strlen(address)));
+    LOG_NOTE("set vex_log_manage client mode\n");
+}
+
+void set_port(const char *port)
+{
+    if (std::strlen(port) > kArgumentMax) {
+        refuse("--port", port);
+        return;
+    }
+    vex_set_nv_item("log_server_port", port, static_cast<int>(std::strlen(port)));
+}
+
+void print_usage(const char *name)
+{
+    std::printf("\n Usage for %s:\n", name);
+    std::puts("\n-a, --address:\t Server IP address");
+    std::puts("\n-p, --port:\t Server Port number");
+    std::puts("\n-r, --retry:\t Number of retries for connect");
+    std::puts("\n-h, --help:\t usage help");
+    std::puts("\ne.g. vex_log_manage -a <ip address> -p <port number> -r <num retries>");
+}
+
+} // namespace
+
+log_options_result log_parse_options(int argc, char **argv)
+{
+    static constexpr option kLong[] = {{"address", required_argument, nullptr, 'a'},
+                                       {"port", required_argument, nullptr, 'p'},
+                                       {"retry", required_argument, nullptr, 'r'},
+                                       {"help", no_argument, nullptr, 'h'},
+                                       {nullptr, 0, nullptr, 0}};
+    int found = 0;
+    while ((found = getopt_long(argc, argv, "a:p:r:h", kLong, nullptr)) != -1) {
+        if (found == 'a')
+            set_address(optarg);
+        else if (found == 'p')
+            set_port(optarg);
+        else if (found == 'r')
+            g_daemon.retry_count = log_text_to_int(optarg);
+        else if (found == 'h') {
+            print_usage(argv[0]);
+            return log_options_result::help;
+        }
+    }
+    return log_options_result::run;
+}

@@ -1,0 +1,50 @@
+#include "core/log_process.h"
+
+#include "core/log_tools.h"
+
+#include <csignal>
+#include <dirent.h>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace
+{
+
+void open_standard_streams()
+{
+    int fd = 0;
+    while (fd >= 0 && fd <= STDERR_FILENO)
+        fd = open("/dev/null", O_RDWR);
+    if (fd > STDERR_FILENO)
+        close(fd);
+}
+
+void close_inherited_on_exec()
+{
+    DIR *open_fds = opendir("/proc/self/fd");
+    if (open_fds == nullptr)
+        return;
+    while (const dirent *entry = readdir(open_fds)) {
+        const int fd = log_text_to_int(entry->d_name); /* 0 for "." and ".." */
+        if (fd > STDERR_FILENO)
+            fcntl(fd, F_SETFD, FD_CLOEXEC);
+    }
+    closedir(open_fds);
+}
+
+/* Unlike SIG_IGN, a handler is not inherited by the programs that the daemon starts. */
+void on_broken_pipe(int /*signal*/) {}
+
+} // namespace
+
+void log_prepare_process()
+{
+    open_standard_streams();
+    close_inherited_on_exec();
+    struct sigaction action {
+    };
+    action.sa_handler = on_broken_pipe;
+    action.sa_flags = SA_RESTART;
+    sigaction(SIGPIPE, &action, nullptr);
+    signal(SIGCHLD, SIG_DFL); /* a starter that ignored it would keep us from learning how our programs end */
+}

@@ -1,0 +1,13 @@
+/* What the daemon asks of its process before anything else runs in it. */
+#ifndef CORE_LOG_PROCESS_H
+#define CORE_LOG_PROCESS_H
+
+/*
+ * Opens /dev/null as every standard stream that the starter left closed, so that no socket can become one; keeps
+ * whatever else the starter left open from the programs that the daemon starts; makes a write to a peer that went
+ * away fail instead of killing the process, which is not passed on to those programs; and makes sure that their end
+ * can be waited for. Called first in main(), once.
+ */
+void log_prepare_process();
+
+#endif

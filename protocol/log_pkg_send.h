@@ -1,0 +1,19 @@
+/* The one way in which the daemon's handlers and client threads send a frame. */
+#ifndef PROTOCOL_LOG_PKG_SEND_H
+#define PROTOCOL_LOG_PKG_SEND_H
+
+#include <openssl/ossl_typ.h>
+
+/*
+ * Sends one frame whole. The caller holds the link (log_cmd_use), so that frames never mix.
+ *   fd       the connection's socket; negative where there is none
+ *   ssl      its TLS session, null without TLS
+ *   control  the control text, ended by NUL, up to kPkgControlMax bytes
+ *   data     the data part, never null, also where there is none
+ *   dataLen  its length in bytes, up to kPkgDataMax
+ * 0 sent; -1 refused or failed, logged but where an argument is missing. A failed send is not tried again and
+ * the connection is left as it is.
+ */
+int log_send_pkg_msg(int fd, SSL *ssl, const char *control, const void *data, int dataLen);
+
+#endif

@@ -1,0 +1,87 @@
+#include "protocol/log_recv.h"
+
+#include "core/log_line.h"
+#include "core/log_registry.h"
+#include "protocol/log_reassembly.h"
+
+#include <cerrno>
+#include <cstdint>
+#include <cstring>
+#include <sys/socket.h>
+#include <unistd.h>
+
+namespace
+{
+
+constexpr char kLogSource[] = "vex_log_manage";
+constexpr char kName[] = "log_recv_tcp_msg"; /* the routine that the log lines speak of */
+
+constexpr std::size_t kPieceMax = 2000;         /* bytes per read */
+constexpr useconds_t kInterruptedPause = 20000; /* microseconds */
+
+/* Serves the connection for as long as it lives, and closes it whichever way its thread ends. */
+struct cmd_owner {
+    explicit cmd_owner(int connection) : fd(connection) { log_cmd_serve(fd); }
+    ~cmd_owner() { log_cmd_close(fd); }
+    cmd_owner(const cmd_owner &) = delete;
+    cmd_owner &operator=(const cmd_owner &) = delete;
+    const int fd;
+};
+
+/* The blocking read, the one place where the thread can be cancelled. */
+ssize_t read_piece(int fd, std::span<unsigned char> piece)
+{
+    pthread_setcancelstate(PTHREAD_CANCEL_ENABLE, nullptr);
+    const ssize_t n = recv(fd, piece.data(), piece.size(), 0);
+    pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
+    return n;
+}
+
+/* Reads and handles pieces until the connection has ended. */
+void receive(int fd)
+{
+    log_reassembly state;
+    unsigned char piece[kPieceMax];
+    for (;;) {
+        const ssize_t n = read_piece(fd, piece);
+        if (n == -1 && errno == EINTR) {
+            usleep(kInterruptedPause);
+            continue;
+        }
+        if (n <= 0) {
+            if (n == -1)
+                LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(errno));
+            else
+                LOG_NOTE("%s:recvcount=0,client close\n", kName);
+            return;
+        }
+        LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(n));
+        {
+            const log_cmd_turn turn;
+            if (!turn.granted())
+                return;
+            log_proc_tcp_pkg(state, {piece, static_cast<std::size_t>(n)});
+        }
+        LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
+    }
+}
+
+} // namespace
+
+void *log_recv_argument(int fd)
+{
+    return reinterpret_cast<void *>(static_cast<std::intptr_t>(fd));
+}
+
+void *log_recv_tcp_msg(void *connection)
+{
+    pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
+    const int fd = static_cast<int>(reinterpret_cast<std::intptr_t>(connection));
+    {
+        const cmd_owner owner{fd};
+        LOG_NOTE("enter %s: fd=[%d]\n", __func__, fd);
+        receive(fd);
+    }
+    LOG_NOTE("exit %s: fd=[%d]\n", __func__, fd);
+    return nullptr;
+}

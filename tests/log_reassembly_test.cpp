@@ -1,0 +1,103 @@
+#include "protocol/log_reassembly.h"
+#include "tests/frame.h"
+#include "tests/memory_platform.h"
+#include "tests/recording_handlers.h"
+
+#include <gtest/gtest.h>
+
+namespace
+{
+
+const std::string kThree = frame(R"({"msgid":"3"})");
+const std::string kOne = frame(R"({"msgid":"1"})", "~#\n#~");
+const std::string kFour = frame(R"({"msgid":"4"})");
+const std::string kAll = R"(3:{"msgid":"3"}:;1:{"msgid":"1"}:)"
+                         "~#\n#~"
+                         R"(;4:{"msgid":"4"}:;)";
+
+class Reassembly : public testing::Test
+{
+protected:
+    void SetUp() override { g_platform = {}; }
+
+    /* Feeds the bytes in reads as the receive loop makes them; returns the commands that this set off. */
+    std::string feed(const std::string &stream)
+    {
+        g_commands.clear();
+        for (std::size_t at = 0; at < stream.size(); at += 2000) {
+            const std::string piece = stream.substr(at, 2000);
+            EXPECT_EQ(0, log_proc_tcp_pkg(state_, {bytes(piece), piece.size()}));
+        }
+        return g_commands;
+    }
+
+    log_reassembly state_;
+};
+
+TEST_F(Reassembly, HandlesFramesSplitAtEveryPosition)
+{
+    const std::string stream = kThree + kOne + kFour;
+    for (std::size_t cut = 0; cut <= stream.size(); ++cut) {
+        const std::string before = feed(stream.substr(0, cut));
+        ASSERT_EQ(kAll, before + feed(stream.substr(cut))) << cut;
+        EXPECT_EQ(0u, state_.recv_pkg_len);
+    }
+    std::string commands;
+    for (const char byte : stream)
+        commands += feed(std::string(1, byte));
+    EXPECT_EQ(kAll, commands);
+}
+
+TEST_F(Reassembly, TellsWhatItWaitsFor)
+{
+    const struct {
+        std::string piece;
+        const char *last_line;
+    } pieces[] = {
+        {kThree + kFour.substr(0, 5), "0 vex_log_manage log_proc_tcp_pkg: recv data too small=30|"},
+        {kFour.substr(5, 18), "log_proc_tcp_pkg: controlLen =13|6 vex_log_manage log_proc_tcp_pkg: continue "
+                              "recv data, Received =23|"},
+        {kFour.substr(23, 1),
+         "log_proc_tcp_pkg: dataLen =0|6 vex_log_manage log_proc_tcp_pkg: continue recv data, Received =24|"},
+        {kFour.substr(24), "6 vex_log_manage log_proc_tcp_pkg: tmp_buf remaining len =[0] $|"},
+    };
+    for (const auto &p : pieces) {
+        feed(p.piece);
+        EXPECT_TRUE(g_platform.log.ends_with(p.last_line)) << g_platform.log;
+    }
+    EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg: tmp_buf remaining len =[5] $|"));
+    EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg:A complete packet of data received  =25|"));
+}
+
+TEST_F(Reassembly, DropsABadFrameAndHandlesTheGoodOneBehindIt)
+{
+    EXPECT_EQ(R"(3:{"msgid":"3"}:;4:{"msgid":"4"}:;)",
+              feed(frame(std::string(2049, ' ')) + kThree + frame("") + kFour));
+    EXPECT_TRUE(g_platform.logged("6 vex_log_manage log_proc_tcp_pkg: decode log msg error,drop this piece data$|"));
+    EXPECT_TRUE(g_platform.logged("6 log_json_codec log_json_get_msgid para len error$|"));
+    /* The longest control text, which fills its field, has its NUL too. */
+    const std::string control = R"({"msgid":"8"})" + std::string(2035, ' ');
+    EXPECT_EQ("8:" + control + ":dd;", feed(frame(control, "dd")));
+}
+
+TEST_F(Reassembly, StartsAfreshWithThePieceThatWouldFillTheBuffer)
+{
+    std::string wrong_tail = kThree;
+    wrong_tail.back() = '!';
+    for (const std::string &stuck : {std::string("?"), "#~" + big_endian(0xffffffff), wrong_tail}) {
+        g_platform = {};
+        EXPECT_EQ("", feed(stuck + std::string(61439 - stuck.size(), 'x')));
+        EXPECT_FALSE(g_platform.logged("tmpbuf small"));
+        EXPECT_EQ(R"(4:{"msgid":"4"}:;)", feed(kFour));
+        EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg: tmpbuf small,drop old content.$|"));
+    }
+    /* A frame of 61440 bytes is never whole; one of a byte less is. */
+    EXPECT_EQ("", feed(frame(R"({"msgid":"1"})", std::string(61440 - kThree.size(), 'd'))));
+    state_ = {};
+    EXPECT_NE("", feed(frame(R"({"msgid":"1"})", std::string(61439 - kThree.size(), 'd'))));
+    const std::string huge(61440, 'x'); /* no reader makes such a piece, and it overruns nothing */
+    EXPECT_EQ(0, log_proc_tcp_pkg(state_, {bytes(huge), huge.size()}));
+    EXPECT_EQ(0u, state_.recv_pkg_len);
+}
+
+} // namespace
