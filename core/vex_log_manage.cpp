@@ -1,0 +1,88 @@
+/* The daemon's entry point: start-up, then the wait for its end. All work is done on the threads started
+ * here. */
+#include "core/daemon_state.h"
+#include "core/log_line.h"
+#include "core/log_options.h"
+#include "core/log_process.h"
+#include "core/log_tools.h"
+#include "transport/log_server.h"
+
+#include <charconv>
+#include <cstdio>
+#include <unistd.h>
+
+namespace
+{
+
+constexpr char kLogSource[] = "vex_log_manage";
+
+constexpr unsigned kExitPoll = 5; /* seconds between two looks at exit_flag */
+
+/* Takes one unit of the start counter; false when there is none left and the daemon is to stay off. */
+bool consume_start()
+{
+    char count[8] = {};
+    vex_get_nv_item("log_manage_switch", count, sizeof count);
+    const int starts = log_text_to_int(count);
+    if (starts < 1) {
+        LOG_NOTE("log_manage_switch disable \n");
+        return false;
+    }
+    *std::to_chars(count, count + sizeof count - 1, starts - 1).ptr = '\0'; /* never more digits than were read */
+    vex_set_nv_item("log_manage_switch", count, sizeof count);
+    return true;
+}
+
+int read_run_mode()
+{
+    char mode[8] = {};
+    vex_get_nv_item("log_manage_mode", mode, sizeof mode);
+    return log_text_to_int(mode);
+}
+
+void start_system_log()
+{
+    char path[16] = {};
+    char level[16] = {};
+    char size[16] = {};
+    vex_get_nv_item("syslog_path", path, sizeof path);
+    vex_get_nv_item("syslog_level", level, sizeof level);
+    vex_get_nv_item("syslog_size", size, sizeof size);
+    char cmd[256] = {};
+    std::snprintf(cmd, sizeof cmd, "sh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o %s -l %s -s %s ", path, level,
+                  size);
+    log_exec_cmd(cmd);
+}
+
+void run_server_mode()
+{
+    start_system_log();
+    vex_log_server_thread();
+    vex_log_server_thread_ipv6();
+}
+
+void wait_for_exit()
+{
+    while (g_daemon.exit_flag == 0)
+        sleep(kExitPoll);
+}
+
+} // namespace
+
+int main(int argc, char **argv)
+{
+    log_prepare_process();
+    LOG_NOTE("start vex_log_manage...\n");
+    if (log_parse_options(argc, argv) == log_options_result::help)
+        return 0;
+    if (!consume_start())
+        return 0;
+    g_daemon.run_mode = read_run_mode();
+    if (g_daemon.run_mode != 0) {
+        LOG_FAULT("client mode is not part of this build, nothing to do\n");
+        return 1;
+    }
+    run_server_mode();
+    wait_for_exit();
+    return 0;
+}

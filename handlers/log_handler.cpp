@@ -1,0 +1,59 @@
+#include "handlers/log_handler.h"
+
+#include "core/log_line.h"
+#include "core/log_registry.h"
+#include "protocol/log_json_codec.h"
+#include "protocol/log_pkg_send.h"
+
+#include <cstdarg>
+#include <cstdio>
+
+namespace
+{
+
+constexpr std::size_t kReplySize = 1024;
+
+} // namespace
+
+bool log_handler_entered(const char *name, const char *control, const unsigned char *data)
+{
+    if (control == nullptr || data == nullptr) {
+        LOG_NOTE("%s para null error\n", name);
+        return false;
+    }
+    if (*control == '\0') {
+        LOG_NOTE("%s para len error\n", name);
+        return false;
+    }
+    return true;
+}
+
+json_tree log_handler_parse(const char *name, const char *control)
+{
+    LOG_NOTE("%s:recv jsonstr = %s", name, control);
+    json_tree request = log_json_parse(control);
+    if (!request)
+        LOG_NOTE("cJSON_Parse error\n");
+    return request;
+}
+
+const char *log_member_text(const cJSON *object, const char *name)
+{
+    return cJSON_GetStringValue(cJSON_GetObjectItem(object, name));
+}
+
+void log_reply_text(const char *control)
+{
+    const log_cmd_use link;
+    log_send_pkg_msg(link.fd(), link.ssl(), control, "", 0);
+}
+
+void log_reply(const char *format, ...)
+{
+    char reply[kReplySize];
+    va_list args;
+    va_start(args, format);
+    std::vsnprintf(reply, sizeof reply, format, args);
+    va_end(args);
+    log_reply_text(reply);
+}

@@ -1,0 +1,201 @@
+#include "tests/daemon.h"
+
+#include "tests/frame.h"
+
+#include <arpa/inet.h>
+#include <csignal>
+#include <cstring>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <gtest/gtest.h>
+#include <netdb.h>
+#include <poll.h>
+#include <sstream>
+#include <sys/inotify.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <thread>
+
+namespace
+{
+
+constexpr char kLogFile[] = "/tmp/daemon.log";
+constexpr char kNvFile[] = "/etc/vex/nvconfig";
+
+bool readable(int fd)
+{
+    pollfd entry{fd, POLLIN, 0};
+    return poll(&entry, 1, kPatience) == 1;
+}
+
+bool receive_exactly(int fd, std::size_t count, std::string &out)
+{
+    out.assign(count, '\0');
+    return count == 0 || (readable(fd) && recv(fd, out.data(), count, MSG_WAITALL) == static_cast<ssize_t>(count));
+}
+
+} // namespace
+
+tool_connection::tool_connection(const char *address)
+{
+    addrinfo *to = nullptr;
+    EXPECT_EQ(0, getaddrinfo(address, "48888", nullptr, &to));
+    fd.reset(socket(to->ai_family, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    int result = -1;
+    /* The daemon's last word before it listens is a log line, a moment ahead of the call. */
+    for (int i = 0; i < 100000 && (result = connect(fd.get(), to->ai_addr, to->ai_addrlen)) != 0; ++i)
+        std::this_thread::yield();
+    EXPECT_EQ(0, result) << std::strerror(errno);
+    freeaddrinfo(to);
+}
+
+void tool_connection::send(const std::string &bytes) const
+{
+    EXPECT_EQ(static_cast<ssize_t>(bytes.size()), ::send(fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL));
+}
+
+std::string tool_connection::receive() const
+{
+    const auto number = [](const std::string &s) {
+        std::uint32_t n = 0;
+        std::memcpy(&n, s.data(), sizeof n);
+        return ntohl(n);
+    };
+    std::string head, length, control, rest;
+    if (!receive_exactly(fd.get(), 2, head) || !receive_exactly(fd.get(), 4, length) ||
+        !receive_exactly(fd.get(), number(length), control) || !receive_exactly(fd.get(), 4, length) ||
+        !receive_exactly(fd.get(), number(length) + 2, rest))
+        return "(closed)";
+    return head == "#~" && rest == "~#" ? control : "(no frame)";
+}
+
+std::string tool_connection::ask(const std::string &control) const
+{
+    send(frame(control));
+    return receive();
+}
+
+daemon_process::daemon_process(const std::vector<std::string> &arguments, bool streams)
+    : log_changes_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK))
+{
+    std::filesystem::create_directories("/run/vex/msg");
+    std::ofstream{kLogFile};
+    inotify_add_watch(log_changes_.get(), kLogFile, IN_MODIFY);
+    std::vector<char *> argv{const_cast<char *>("vex_log_manage")};
+    for (const std::string &argument : arguments)
+        argv.push_back(const_cast<char *>(argument.c_str()));
+    argv.push_back(nullptr);
+    setenv("VEX_LOG_FILE", kLogFile, 1);
+    pid = fork();
+    if (pid != 0)
+        return;
+    const unique_fd out{open("/tmp/daemon.out", O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600)};
+    dup2(out.get(), 1);
+    dup2(out.get(), 2);
+    for (int i = 0; !streams && i <= 2; ++i)
+        close(i);
+    execvp(argv[0], argv.data());
+    _exit(127);
+}
+
+daemon_process::~daemon_process()
+{
+    if (pid != -1) {
+        kill(pid, SIGKILL);
+        waitpid(pid, nullptr, 0);
+    }
+    EXPECT_EQ("", run_command("grep -A30 -E 'Sanitizer|runtime error' /tmp/daemon.out"));
+}
+
+void daemon_process::wait_listening()
+{
+    EXPECT_TRUE(logs("log_server_handle_tcp_msg enter"));
+    EXPECT_TRUE(logs("log_server_handle_tcp_msg_ipv6 accept before"));
+}
+
+int daemon_process::wait_exit()
+{
+    int status = 0;
+    waitpid(pid, &status, 0);
+    pid = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+std::string daemon_process::log() const
+{
+    return read_file(kLogFile);
+}
+
+long daemon_process::logged(const std::string &text) const
+{
+    long count = 0;
+    const std::string all = log();
+    for (std::size_t at = 0; (at = all.find(text, at)) != std::string::npos; ++at)
+        ++count;
+    return count;
+}
+
+bool daemon_process::logs(const std::string &text, long count) const
+{
+    while (logged(text) < count) {
+        char events[4096];
+        if (!readable(log_changes_.get()))
+            return false;
+        EXPECT_LT(0, read(log_changes_.get(), events, sizeof events));
+    }
+    return true;
+}
+
+bool daemon_process::waits_in(long syscall) const
+{
+    for (const auto &task : std::filesystem::directory_iterator(proc("task"))) {
+        std::istringstream state(read_file(task.path() / "syscall")); /* "running", or the call's number first */
+        long number = -1;
+        if (state >> number && number == syscall)
+            return true;
+    }
+    return false;
+}
+
+std::size_t entries(const std::string &dir)
+{
+    const std::filesystem::directory_iterator all(dir);
+    return static_cast<std::size_t>(std::distance(begin(all), end(all)));
+}
+
+std::string read_file(const std::string &path)
+{
+    std::ostringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+void set_nv(const std::string &name, const std::string &value)
+{
+    run_command("sed -i '/^" + name + "=/d' /etc/vex/nvconfig");
+    std::ofstream(kNvFile, std::ios::app) << name << '=' << value << '\n';
+}
+
+std::string get_nv(const std::string &name)
+{
+    return run_command("sed -n 's/^" + name + "=//p' /etc/vex/nvconfig | tr -d '\\n'");
+}
+
+void install_program(const std::string &name, const std::string &script)
+{
+    std::ofstream("/usr/vex/bin/" + name) << "#!/bin/sh\n" << script;
+    EXPECT_EQ(0, chmod(("/usr/vex/bin/" + name).c_str(), 0755));
+}
+
+std::string run_command(const std::string &command, int *status)
+{
+    FILE *pipe = popen((command + " 2>&1").c_str(), "re");
+    std::string out;
+    for (int c = 0; (c = std::getc(pipe)) != EOF;)
+        out += static_cast<char>(c);
+    const int result = pclose(pipe);
+    if (status != nullptr)
+        *status = WEXITSTATUS(result);
+    return out;
+}

@@ -1,0 +1,63 @@
+/*
+ * The daemon as a peer and an operator meet it, on the simulated device that the test itself runs in. Waiting is for
+ * events; what does not come within kPatience is a failure.
+ */
+#ifndef TESTS_DAEMON_H
+#define TESTS_DAEMON_H
+
+#include "platform/unique_fd.h"
+
+#include <string>
+#include <sys/types.h>
+#include <vector>
+
+constexpr int kPatience = 30000; /* milliseconds */
+
+/* A log tool's connection to 127.0.0.1 or ::1. */
+struct tool_connection {
+    explicit tool_connection(const char *address = "127.0.0.1");
+    void send(const std::string &bytes) const;
+    std::string receive() const; /* the control text of the next frame; "(closed)" when there is none */
+    std::string ask(const std::string &control) const;
+    unique_fd fd;
+};
+
+class daemon_process
+{
+public:
+    /* Starts it, with standard streams or without; its NV items are those of /etc/vex/nvconfig. */
+    explicit daemon_process(const std::vector<std::string> &arguments = {}, bool streams = true);
+    ~daemon_process(); /* kills it; a sanitizer's report is a failure of the test */
+    daemon_process(const daemon_process &) = delete;
+
+    void wait_listening();
+    int wait_exit(); /* its exit status */
+    /* All log lines, and how many of them hold the text. */
+    std::string log() const;
+    long logged(const std::string &text) const;
+    /* Waits until so many do. */
+    bool logs(const std::string &text, long count = 1) const;
+    std::string proc(const char *name) const { return "/proc/" + std::to_string(pid) + '/' + name; }
+    /* Whether one of its threads waits in that system call. */
+    bool waits_in(long syscall) const;
+
+    pid_t pid = -1;
+
+private:
+    unique_fd log_changes_;
+};
+
+std::size_t entries(const std::string &dir);
+std::string read_file(const std::string &path);
+
+/* Sets an item in the device's NV file, as an operator would; an item's value. */
+void set_nv(const std::string &name, const std::string &value);
+std::string get_nv(const std::string &name);
+
+/* Puts a shell script into the device's path, ahead of the program of that name. */
+void install_program(const std::string &name, const std::string &script);
+
+/* What a command prints, and its exit status. */
+std::string run_command(const std::string &command, int *status = nullptr);
+
+#endif

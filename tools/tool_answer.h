@@ -1,0 +1,31 @@
+/* What a device's reply says. */
+#ifndef TOOLS_TOOL_ANSWER_H
+#define TOOLS_TOOL_ANSWER_H
+
+#include "protocol/json_tree.h"
+
+#include <string>
+
+enum class tool_verdict {
+    success, /* the device said "Success" */
+    failed,  /* it said "Fail:" and why */
+    refused, /* an empty reply: it does not carry out such a request */
+    garbled, /* not a reply of the protocol */
+};
+
+struct tool_answer {
+    tool_verdict verdict;
+    std::string reason; /* a sentence for a person; empty after success */
+    json_tree root;     /* the reply, where it is JSON */
+};
+
+/* The text as a terminal may show it: control bytes, which could command the terminal, as \xNN. */
+std::string tool_printable(const std::string &text);
+
+/* Judges the control text of a reply. */
+tool_answer tool_read_answer(const std::string &control);
+
+/* The printable text of the reply's member `name` inside its member `group`; empty when there is none. */
+std::string tool_answer_text(const tool_answer &answer, const char *group, const char *name);
+
+#endif

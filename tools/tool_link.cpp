@@ -1,0 +1,200 @@
+#include "tools/tool_link.h"
+
+#include "protocol/log_pkg_codec.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <memory>
+#include <netdb.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <poll.h>
+#include <sys/socket.h>
+
+namespace
+{
+
+using clock_type = std::chrono::steady_clock;
+
+struct address_list_deleter {
+    void operator()(addrinfo *list) const { freeaddrinfo(list); }
+};
+
+using address_list = std::unique_ptr<addrinfo, address_list_deleter>;
+
+std::string seconds(std::chrono::milliseconds limit)
+{
+    const auto ms = limit.count();
+    std::string text = std::to_string(ms / 1000);
+    if (ms % 1000 != 0)
+        text += '.' + std::to_string(ms % 1000 + 1000).substr(1);
+    return text + " s";
+}
+
+/* Waits until the socket is ready for `events` or the time has come; false when it has come. */
+bool wait_ready(int fd, short events, clock_type::time_point end)
+{
+    for (;;) {
+        const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - clock_type::now());
+        pollfd entry{fd, events, 0};
+        const int n = poll(&entry, 1, left.count() > 0 ? static_cast<int>(left.count()) : 0);
+        if (n > 0)
+            return true;
+        if (n == 0 || errno != EINTR)
+            return false;
+    }
+}
+
+/* A connected non-blocking socket to one address; none on failure, and the error's text unless it was the time. */
+unique_fd connect_one(const addrinfo &address, clock_type::time_point end, std::string &error)
+{
+    unique_fd sock{socket(address.ai_family, address.ai_socktype | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
+    int failure = 0;
+    if (!sock || (connect(sock.get(), address.ai_addr, address.ai_addrlen) != 0 && errno != EINPROGRESS)) {
+        failure = errno;
+    } else if (!wait_ready(sock.get(), POLLOUT, end)) {
+        return {};
+    } else {
+        socklen_t len = sizeof failure;
+        getsockopt(sock.get(), SOL_SOCKET, SO_ERROR, &failure, &len);
+    }
+    if (failure == 0)
+        return sock;
+    error = std::strerror(failure);
+    return {};
+}
+
+/* Why a connection ended before the answer was there. */
+std::string ended(const tool_link &link, const std::string &how)
+{
+    return "the connection to " + link.where + " ended before the answer was there: " + how +
+           ". The device serves one log tool at a time, so another one may have taken it over; if not, try again and "
+           "look at the device's own log";
+}
+
+/* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are
+ * none. */
+std::optional<std::size_t> frame_length(const std::vector<unsigned char> &held)
+{
+    if (held.size() < kPkgMin)
+        return 0;
+    const std::uint32_t control_len = log_pkg_get_u32(held.data() + kPkgControlLenAt);
+    if (std::memcmp(held.data(), PKG_HEAD, kPkgTagLen) != 0 || control_len > kPkgControlMax)
+        return std::nullopt;
+    const std::size_t data_len_at = kPkgControlAt + control_len;
+    if (held.size() < data_len_at + 4)
+        return 0;
+    const std::uint32_t data_len = log_pkg_get_u32(held.data() + data_len_at);
+    if (data_len > kPkgDataMax)
+        return std::nullopt;
+    return kPkgMin + control_len + data_len;
+}
+
+/* Takes the frame of `len` bytes off the held bytes. */
+std::optional<tool_frame> take_frame(tool_link &link, std::size_t len)
+{
+    const auto msg = std::make_unique<log_msg>();
+    if (log_decode_msg(link.held.data(), len, msg.get()) != 0)
+        return std::nullopt;
+    tool_frame frame;
+    frame.control.assign(msg->control, static_cast<std::size_t>(msg->controlLen));
+    frame.data.assign(msg->data, msg->data + msg->dataLen);
+    link.held.erase(link.held.begin(), link.held.begin() + static_cast<std::ptrdiff_t>(len));
+    return frame;
+}
+
+/* Waits for more bytes and holds them. */
+bool receive_some(tool_link &link, std::string &why)
+{
+    const auto limit = link.held.empty() ? link.limits.reply : link.limits.stall;
+    if (!wait_ready(link.fd.get(), POLLIN, clock_type::now() + limit)) {
+        why = link.where + " sent nothing for " + seconds(limit) +
+              (link.held.empty()
+                   ? ". Either it is still at work, then try again with a larger --reply-timeout, or it does "
+                     "not know the command: such a one it leaves unanswered"
+                   : " in the middle of an answer. Try again with a larger --stall-timeout");
+        return false;
+    }
+    unsigned char piece[16384];
+    const ssize_t n = recv(link.fd.get(), piece, sizeof piece, 0);
+    if (n > 0)
+        link.held.insert(link.held.end(), piece, piece + n);
+    else if (n == 0)
+        why = ended(link, "the device closed it");
+    else if (errno != EAGAIN && errno != EINTR)
+        why = ended(link, std::strerror(errno));
+    return why.empty();
+}
+
+} // namespace
+
+std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
+                                      std::string &why)
+{
+    const std::string where = host + " port " + port;
+    addrinfo hints{};
+    hints.ai_socktype = SOCK_STREAM;
+    addrinfo *found = nullptr;
+    if (const int code = getaddrinfo(host.c_str(), port.c_str(), &hints, &found); code != 0) {
+        why = "cannot find " + where + ": " + gai_strerror(code) + ". Check --host and --port";
+        return std::nullopt;
+    }
+    const address_list addresses{found};
+    const auto end = clock_type::now() + limits.connect;
+    std::string error = "no answer within " + seconds(limits.connect);
+    for (const addrinfo *at = addresses.get(); at != nullptr; at = at->ai_next) {
+        unique_fd sock = connect_one(*at, end, error);
+        if (!sock)
+            continue;
+        const int on = 1;
+        setsockopt(sock.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
+        return tool_link{std::move(sock), where, limits, {}};
+    }
+    why = "cannot connect to " + where + ": " + error +
+          ". Check the address, and that the device is on and its log daemon runs in server mode";
+    return std::nullopt;
+}
+
+bool tool_send(tool_link &link, const std::string &control, std::string &why)
+{
+    const auto msg = std::make_unique<log_msg>();
+    std::vector<unsigned char> frame(kPkgSendBuf);
+    auto len = static_cast<std::int32_t>(frame.size());
+    if (log_encode_fill_msg(control.c_str(), "", 0, msg.get()) != 0 ||
+        log_encode_pkg_buf(frame.data(), &len, msg.get()) != 0) {
+        why = "the command has " + std::to_string(control.size()) + " characters; " + std::to_string(kPkgControlMax) +
+              " is the most";
+        return false;
+    }
+    for (std::size_t sent = 0; sent < static_cast<std::size_t>(len);) {
+        const ssize_t n = send(link.fd.get(), frame.data() + sent, static_cast<std::size_t>(len) - sent, MSG_NOSIGNAL);
+        if (n > 0) {
+            sent += static_cast<std::size_t>(n);
+        } else if (errno != EAGAIN && errno != EINTR) {
+            why = ended(link, std::strerror(errno));
+            return false;
+        } else if (!wait_ready(link.fd.get(), POLLOUT, clock_type::now() + link.limits.stall)) {
+            why = link.where + " took nothing for " + seconds(link.limits.stall) +
+                  ". It may be busy with another command: try again with a larger --stall-timeout";
+            return false;
+        }
+    }
+    return true;
+}
+
+std::optional<tool_frame> tool_receive(tool_link &link, std::string &why)
+{
+    for (;;) {
+        const std::optional<std::size_t> len = frame_length(link.held);
+        if (len && (*len == 0 || link.held.size() < *len)) {
+            if (!receive_some(link, why))
+                return std::nullopt;
+            continue;
+        }
+        std::optional<tool_frame> frame = len ? take_frame(link, *len) : std::nullopt;
+        if (!frame)
+            why = "what " + link.where + " sent is not a frame. Is it a device's log daemon that listens there?";
+        return frame;
+    }
+}

@@ -1,0 +1,45 @@
+/*
+ * A connection to a device's log daemon, as the log tool uses it: every wait has a limit, and every failure
+ * is a sentence that says what failed, at which address, why, and what to try.
+ *
+ * Procedures that can fail return false or nothing and store that sentence in `why`; one thread uses a link.
+ */
+#ifndef TOOLS_TOOL_LINK_H
+#define TOOLS_TOOL_LINK_H
+
+#include "platform/unique_fd.h"
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <vector>
+
+struct tool_limits {
+    std::chrono::milliseconds connect{5000}; /* until one of its addresses has accepted; not the look-up */
+    std::chrono::milliseconds reply{60000};  /* until the first byte of an answer */
+    std::chrono::milliseconds stall{15000};  /* from one byte to the next, both ways */
+};
+
+struct tool_link {
+    unique_fd fd;
+    std::string where; /* the device's address and port, for messages */
+    tool_limits limits;
+    std::vector<unsigned char> held; /* received bytes behind the frames that were taken */
+};
+
+struct tool_frame {
+    std::string control;
+    std::vector<unsigned char> data;
+};
+
+/* Connects to the first address of `host` that accepts. */
+std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
+                                      std::string &why);
+
+/* Sends one frame without data. */
+bool tool_send(tool_link &link, const std::string &control, std::string &why);
+
+/* Waits for the next frame. */
+std::optional<tool_frame> tool_receive(tool_link &link, std::string &why);
+
+#endif
