@@ -91,8 +91,7 @@ private:
     bool granted_ = false;
 };
 
-/* The command connection, held for one frame. fd() is -1 when there is none or this thread has lost its own.
- */
+/* The command connection, held for one frame. fd() is -1 when there is none or this thread has lost its own. */
 class log_cmd_use
 {
 public:

@@ -29,8 +29,7 @@ int log_thread_create(log_thread_task *task, void *argument);
  * size - 1 characters arrive. 0 read (and logged), -1 missing, unreadable or bad arguments. */
 int vex_get_nv_item(const char *name, char *buffer, int size);
 
-/* Writes `len` bytes of `value` as the NV item `name` and commits the store. 0 written, -1 failed (logged).
- */
+/* Writes `len` bytes of `value` as the NV item `name` and commits the store. 0 written, -1 failed (logged). */
 int vex_set_nv_item(const char *name, const char *value, int len);
 
 /* The NV item `name` as a decimal number; 0 when it is empty, unreadable or no number. */
@@ -46,8 +45,7 @@ int log_text_to_int(const char *text);
 /* ---- Programs ---- */
 
 /* Runs the shell command line and waits for the shell, then flushes file systems to storage. 0 when it exited
- * with status 0, else -1 (logged). A line that ends in "&" leaves its program running and yields 0 at once.
- */
+ * with status 0, else -1 (logged). A line that ends in "&" leaves its program running and yields 0 at once. */
 int log_exec_cmd(const char *cmdStr);
 
 /* Runs the shell command line and captures the first line of its output, without its newline and cut at size

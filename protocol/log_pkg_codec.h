@@ -54,8 +54,7 @@ void log_msg_clear(log_msg *msg);
 /* The 32-bit big-endian number at `at`. */
 std::uint32_t log_pkg_get_u32(const unsigned char *at);
 
-/* `at` when the head tag (the tail tag) stands there, whole and before `end`; else null. They do not search.
- */
+/* `at` when the head tag (the tail tag) stands there, whole and before `end`; else null. They do not search. */
 const unsigned char *log_FindHead_pkg(const unsigned char *at, const unsigned char *end);
 const unsigned char *log_FindTail_pkg(const unsigned char *at, const unsigned char *end);
 

@@ -23,8 +23,7 @@ struct log_incoming {
     unsigned char recv_pkg_buf[LOG_RECV_PKG_LEN];
 };
 
-/* One connection's bytes that are not yet a frame. Lives and ends with the connection; one thread feeds it.
- */
+/* One connection's bytes that are not yet a frame. Lives and ends with the connection; one thread feeds it. */
 struct log_reassembly {
     log_block_ptr<log_incoming> incoming; /* allocated by the first piece */
     std::size_t recv_pkg_len = 0;         /* bytes held, from offset 0 */

@@ -37,6 +37,17 @@ ssize_t read_piece(int fd, std::span<unsigned char> piece)
     return n;
 }
 
+/* Logs why the peer's bytes have ended: an error, or 0. One that was replaced did not end them. */
+void log_end(int error)
+{
+    if (!log_cmd_stands())
+        return;
+    if (error != 0)
+        LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(error));
+    else
+        LOG_NOTE("%s:recvcount=0,client close\n", kName);
+}
+
 /* Reads and handles pieces until the connection has ended. */
 void receive(int fd)
 {
@@ -49,10 +60,7 @@ void receive(int fd)
             continue;
         }
         if (n <= 0) {
-            if (n == -1)
-                LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(errno));
-            else
-                LOG_NOTE("%s:recvcount=0,client close\n", kName);
+            log_end(n == -1 ? errno : 0);
             return;
         }
         LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(n));

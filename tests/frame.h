@@ -1,5 +1,4 @@
-/* Frames as a peer builds them, written without the daemon's codec so that both can be wrong only separately.
- */
+/* Frames as a peer builds them, written without the daemon's codec so that both can be wrong only separately. */
 #ifndef TESTS_FRAME_H
 #define TESTS_FRAME_H
 

@@ -36,8 +36,7 @@ log_sink open_sink()
     return sink;
 }
 
-/* Copies `text` to `out` so that a line stays a line, whatever it holds; returns the number of bytes written.
- */
+/* Copies `text` to `out` so that a line stays a line, whatever it holds; returns the number of bytes written. */
 std::size_t escape(const char *text, std::size_t len, char *out)
 {
     constexpr char kHex[] = "0123456789abcdef";

@@ -1,5 +1,4 @@
-/* The maker's message service on any Linux machine: one datagram to a unix socket named after the receiver.
- */
+/* The maker's message service on any Linux machine: one datagram to a unix socket named after the receiver. */
 #include "platform/unique_fd.h"
 #include "platform/vex_platform.h"
 
