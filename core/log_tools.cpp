@@ -22,6 +22,11 @@ namespace
 constexpr char kLogSource[] = "log_tools";
 
 constexpr int kNvIntSize = 32;
+
+/* Bytes of stack for a thread. Frames live in blocks, so the deepest use is a JSON text of nothing but brackets, with
+ * about 100 KB. The usual 8 MB would make the end of a thread dearer, as the kernel looks through all of it. */
+constexpr std::size_t kStackSize = 256 * 1024;
+
 constexpr std::size_t kHexPiece = 500; /* characters of a hex dump in one log line */
 constexpr int kHexMax = INT_MAX / 4;   /* bytes of a hex dump whose text a 32-bit size can count */
 
@@ -53,6 +58,7 @@ int log_thread_create(log_thread_task *task, void *argument)
     if (pthread_attr_init(&attributes) != 0)
         return -1;
     const bool started = pthread_attr_setdetachstate(&attributes, PTHREAD_CREATE_DETACHED) == 0 &&
+                         pthread_attr_setstacksize(&attributes, kStackSize) == 0 &&
                          pthread_create(&task->thread_id, &attributes, task->entry, argument) == 0;
     pthread_attr_destroy(&attributes);
     return started ? 0 : -1;

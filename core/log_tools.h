@@ -19,7 +19,7 @@ struct log_thread_task {
     pthread_t thread_id;    /* the started thread */
 };
 
-/* Starts `task->entry` with `argument` as a detached thread and stores its id in the task. 0 started, -1
+/* Starts `task->entry` with `argument` as a detached thread of 256 KB of stack and stores its id in the task. 0 started, -1
  * failed; only a missing task is logged, the caller logs its own failure. */
 int log_thread_create(log_thread_task *task, void *argument);
 

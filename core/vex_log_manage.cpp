@@ -5,6 +5,7 @@
 #include "core/log_options.h"
 #include "core/log_process.h"
 #include "core/log_tools.h"
+#include "protocol/json_memory.h"
 #include "transport/log_server.h"
 
 #include <charconv>
@@ -72,6 +73,7 @@ void wait_for_exit()
 int main(int argc, char **argv)
 {
     log_prepare_process();
+    json_memory_install();
     LOG_NOTE("start vex_log_manage...\n");
     if (log_parse_options(argc, argv) == log_options_result::help)
         return 0;
