@@ -2,6 +2,7 @@
 
 #include "tests/frame.h"
 
+#include <algorithm>
 #include <arpa/inet.h>
 #include <csignal>
 #include <cstring>
@@ -23,10 +24,10 @@ namespace
 constexpr char kLogFile[] = "/tmp/daemon.log";
 constexpr char kNvFile[] = "/etc/vex/nvconfig";
 
-bool readable(int fd)
+bool readable(int fd, int milliseconds = kPatience)
 {
     pollfd entry{fd, POLLIN, 0};
-    return poll(&entry, 1, kPatience) == 1;
+    return poll(&entry, 1, std::max(milliseconds, 0)) == 1;
 }
 
 bool receive_exactly(int fd, std::size_t count, std::string &out)
@@ -138,9 +139,11 @@ long daemon_process::logged(const std::string &text) const
 
 bool daemon_process::logs(const std::string &text, long count) const
 {
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
     while (logged(text) < count) {
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - std::chrono::steady_clock::now());
         char events[4096];
-        if (!readable(log_changes_.get()))
+        if (!readable(log_changes_.get(), static_cast<int>(left.count())))
             return false;
         EXPECT_LT(0, read(log_changes_.get(), events, sizeof events));
     }
