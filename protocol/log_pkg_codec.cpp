@@ -2,6 +2,7 @@
 
 #include "core/log_line.h"
 
+#include <cstddef>
 #include <cstring>
 
 namespace
@@ -14,17 +15,19 @@ bool tag_stands(const char *tag, const unsigned char *at, const unsigned char *e
     return static_cast<std::size_t>(end - at) >= kPkgTagLen && std::memcmp(at, tag, kPkgTagLen) == 0;
 }
 
-unsigned char *put(unsigned char *at, const void *bytes, std::size_t len)
+/* Bytes may already be where they belong. */
+void put(unsigned char *at, const void *bytes, std::size_t len)
 {
-    std::memcpy(at, bytes, len);
-    return at + len;
+    if (at != bytes)
+        std::memmove(at, bytes, len);
 }
 
-unsigned char *put_u32(unsigned char *at, std::uint32_t value)
+void put_u32(unsigned char *at, std::uint32_t value)
 {
-    const unsigned char bytes[] = {static_cast<unsigned char>(value >> 24), static_cast<unsigned char>(value >> 16),
-                                   static_cast<unsigned char>(value >> 8), static_cast<unsigned char>(value)};
-    return put(at, bytes, sizeof bytes);
+    at[0] = static_cast<unsigned char>(value >> 24);
+    at[1] = static_cast<unsigned char>(value >> 16);
+    at[2] = static_cast<unsigned char>(value >> 8);
+    at[3] = static_cast<unsigned char>(value);
 }
 
 /* Stores a text of at most kPkgControlMax characters, with its NUL where the field has room for one. */
@@ -166,9 +169,14 @@ int log_encode_fill_msg(const char *control, const void *data, std::int32_t data
         LOG_NOTE("%s: dataLen=%d error\n", __func__, dataLen);
         return 1;
     }
-    std::memcpy(msg->data, data, static_cast<std::size_t>(dataLen));
+    put(msg->data, data, static_cast<std::size_t>(dataLen));
     std::memcpy(msg->tailTag, PKG_TAIL, sizeof PKG_TAIL);
     return 0;
+}
+
+unsigned char *log_pkg_place(log_msg *msg)
+{
+    return reinterpret_cast<unsigned char *>(msg) + offsetof(log_msg, data) - 4 - msg->controlLen - kPkgControlAt;
 }
 
 int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg *msg)
@@ -182,13 +190,16 @@ int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg 
         LOG_NOTE("%s: sendLen=%d fail\n", __func__, *sendLen);
         return 1;
     }
-    unsigned char *at = put(out, PKG_HEAD, kPkgTagLen);
-    at = put_u32(at, static_cast<std::uint32_t>(msg->controlLen));
-    at = put(at, msg->control, static_cast<std::size_t>(msg->controlLen));
-    at = put_u32(at, static_cast<std::uint32_t>(msg->dataLen));
-    at = put(at, msg->data, static_cast<std::size_t>(msg->dataLen));
-    at = put(at, PKG_TAIL, kPkgTagLen);
-    *at = '\0';
-    *sendLen = static_cast<std::int32_t>(at - out);
+    const auto control_len = static_cast<std::size_t>(msg->controlLen);
+    const auto data_len = static_cast<std::size_t>(msg->dataLen);
+    unsigned char *const data = out + kPkgControlAt + control_len + 4;
+    /* From back to front, so that the frame may overwrite the record that it is made of. */
+    put(data + data_len, PKG_TAIL, sizeof PKG_TAIL);
+    put(data, msg->data, data_len);
+    put_u32(data - 4, static_cast<std::uint32_t>(data_len));
+    put(out + kPkgControlAt, msg->control, control_len);
+    put_u32(out + kPkgControlLenAt, static_cast<std::uint32_t>(control_len));
+    put(out, PKG_HEAD, kPkgTagLen);
+    *sendLen = static_cast<std::int32_t>(kPkgMin + control_len + data_len);
     return 0;
 }

@@ -68,12 +68,16 @@ int log_decode_msg(const unsigned char *frame, std::size_t len, log_msg *msg);
 
 /*
  * Fills a cleared record with a control text, up to its NUL, and `dataLen` bytes of data. `data` is never
- * null, also where there is none. 0 filled, 1 refused.
+ * null, also where there is none; it may be the record's own `data`. 0 filled, 1 refused.
  */
 int log_encode_fill_msg(const char *control, const void *data, std::int32_t dataLen, log_msg *msg);
 
-/* Writes the record's frame, and a NUL behind it, to `out`. `*sendLen` holds the capacity of `out`, at least
- * kPkgEncodeMin, and then the frame's length. 0 encoded; 1 refused, `*sendLen` is then as it was. */
+/* Where in a filled record its own frame may be written, so that the data need not be moved. */
+unsigned char *log_pkg_place(log_msg *msg);
+
+/* Writes the record's frame, and a NUL behind it, to `out`: a buffer of its own, or log_pkg_place(), and then only
+ * the record's data is left of it. `*sendLen` holds the capacity of `out`, at least kPkgEncodeMin, and then the
+ * frame's length. 0 encoded; 1 refused, `*sendLen` is then as it was. */
 int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg *msg);
 
 #endif

@@ -3,18 +3,15 @@
 #include "core/log_block.h"
 #include "core/log_line.h"
 #include "core/log_tools.h"
-#include "protocol/log_pkg_codec.h"
+
+#include <cstring>
 
 namespace
 {
 
 constexpr char kLogSource[] = "log_pkg_codec";
 
-/* A frame on its way out. Not cleared: the encoder writes every byte that is sent. */
-struct log_outgoing {
-    log_msg msg;
-    unsigned char frame[kPkgSendBuf];
-};
+constexpr char kName[] = "log_send_pkg_msg"; /* the routine that the log lines speak of */
 
 } // namespace
 
@@ -27,20 +24,30 @@ int log_send_pkg_msg(int fd, SSL *ssl, const char *control, const void *data, in
         LOG_NOTE("sendbuf malloc failed .\n");
         return -1;
     }
-    log_msg_clear(&outgoing->msg);
-    if (log_encode_fill_msg(control, data, dataLen, &outgoing->msg) != 0) {
-        LOG_NOTE("%s: encode log msg fail\n", __func__);
+    if (dataLen > 0 && dataLen <= static_cast<int>(kPkgDataMax))
+        std::memcpy(outgoing->msg.data, data, static_cast<std::size_t>(dataLen));
+    return log_send_pkg_piece(fd, ssl, control, outgoing.get(), dataLen);
+}
+
+int log_send_pkg_piece(int fd, SSL *ssl, const char *control, log_outgoing *piece, int dataLen)
+{
+    if (fd < 0 || control == nullptr)
+        return -1;
+    log_msg_clear(&piece->msg);
+    if (log_encode_fill_msg(control, piece->msg.data, dataLen, &piece->msg) != 0) {
+        LOG_NOTE("%s: encode log msg fail\n", kName);
         return -1;
     }
-    int frame_len = sizeof outgoing->frame;
-    if (log_encode_pkg_buf(outgoing->frame, &frame_len, &outgoing->msg) != 0) {
-        LOG_NOTE("%s: encode pkg buf fail\n", __func__);
+    unsigned char *const frame = log_pkg_place(&piece->msg);
+    int frame_len = kPkgSendBuf;
+    if (log_encode_pkg_buf(frame, &frame_len, &piece->msg) != 0) {
+        LOG_NOTE("%s: encode pkg buf fail\n", kName);
         return -1;
     }
-    if (log_send_packet(fd, ssl, outgoing->frame, frame_len) <= 0) {
-        LOG_NOTE("%s: send pkg fail\n", __func__);
+    if (log_send_packet(fd, ssl, frame, frame_len) <= 0) {
+        LOG_NOTE("%s: send pkg fail\n", kName);
         return -1;
     }
-    LOG_NOTE("%s: send pkg success\n", __func__);
+    LOG_NOTE("%s: send pkg success\n", kName);
     return 0;
 }

@@ -1,6 +1,8 @@
-/* The one way in which the daemon's handlers and client threads send a frame. */
+/* How the daemon's handlers and client threads send a frame. */
 #ifndef PROTOCOL_LOG_PKG_SEND_H
 #define PROTOCOL_LOG_PKG_SEND_H
+
+#include "protocol/log_pkg_codec.h"
 
 #include <openssl/ossl_typ.h>
 
@@ -15,5 +17,15 @@
  * the connection is left as it is.
  */
 int log_send_pkg_msg(int fd, SSL *ssl, const char *control, const void *data, int dataLen);
+
+/* A frame on its way out, in a block (core/log_block.h); it is encoded where it lies. */
+struct log_outgoing {
+    log_msg msg;
+    unsigned char rest[kPkgSendBuf]; /* so that from anywhere in the record there are kPkgSendBuf bytes to write to */
+};
+
+/* The same for `dataLen` bytes of data that are already in `piece->msg.data`, and stay there: a piece of a file is
+ * sent without being copied. */
+int log_send_pkg_piece(int fd, SSL *ssl, const char *control, log_outgoing *piece, int dataLen);
 
 #endif
