@@ -17,7 +17,8 @@ struct log_daemon_state {
      * has no use for a TLS library and the memory it takes, so nothing below the client's room is linked with
      * one. */
     int (*ssl_write)(SSL *ssl, const void *bytes, int len) = nullptr;
-    std::atomic<int> exit_flag{0}; /* set to 1 to end the process; start-up looks at it every 5 seconds */
+    std::atomic<int> syslog_realtime_on{0}; /* 1 while the system log is streamed instead of kept on the device */
+    std::atomic<int> exit_flag{0};          /* set to 1 to end the process; start-up looks at it every 5 seconds */
 };
 
 extern log_daemon_state g_daemon;

@@ -60,6 +60,12 @@ void log_cmd_record(int fd, const char *ip)
     std::strncpy(client_ip, ip, sizeof client_ip - 1); /* clears the rest */
 }
 
+void log_cmd_client_ip(char (&ip)[kClientIpSize])
+{
+    const log_lock hold{g_registry_lock};
+    std::memcpy(ip, client_ip, sizeof ip);
+}
+
 void log_cmd_serve(int fd)
 {
     t_served_fd = fd;

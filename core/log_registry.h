@@ -59,6 +59,9 @@ int log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
 /* Records a log tool's connection as the command connection. Whoever reads it will own it. */
 void log_cmd_record(int fd, const char *ip) LOG_REQUIRES(g_takeover_lock);
 
+/* Copies the address of the connected log tool. */
+void log_cmd_client_ip(char (&ip)[kClientIpSize]);
+
 /* Declares the calling thread to be the owner of the command connection `fd`. From now on its commands run,
  * and its replies go out, only while `fd` is still the command connection. A thread that never says so, like
  * one that reads a data link, answers on whatever command connection there is. */

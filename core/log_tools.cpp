@@ -219,6 +219,18 @@ int log_isValidIpOrUrl(const char *text)
     return 0;
 }
 
+int ip_in_subnet(const char *address, const char *peer, const char *netmask)
+{
+    in_addr a{};
+    in_addr p{};
+    in_addr mask{};
+    if (inet_aton(address, &a) == 0 || inet_aton(peer, &p) == 0 || inet_aton(netmask, &mask) == 0)
+        return -1;
+    const int result = ((a.s_addr ^ p.s_addr) & mask.s_addr) == 0 ? 1 : 0;
+    LOG_NOTE("[%s, %s, %s, %d]", address, peer, netmask, result);
+    return result;
+}
+
 int getNthValueSafe(int n, const char *text, char delimiter, char *out, int size)
 {
     if (text == nullptr || delimiter == '\0' || out == nullptr || size <= 0) {

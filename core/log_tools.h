@@ -74,6 +74,10 @@ void log_print_hex_buf(const void *data, int count, const char *tag);
  * too. */
 int log_isValidIpOrUrl(const char *text);
 
+/* Whether two IPv4 addresses, as texts, lie in one subnet of the netmask: 1 yes, 0 no (both logged), -1 when a text is
+ * no IPv4 address. */
+int ip_in_subnet(const char *address, const char *peer, const char *netmask);
+
 /* Copies the field number `n`, from 0, of a text of fields between delimiters to `out`, cut to size - 1
  * characters. 0 copied, -1 when there is no such field or on bad arguments; `out` is then as it was. */
 int getNthValueSafe(int n, const char *text, char delimiter, char *out, int size);

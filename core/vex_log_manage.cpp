@@ -2,14 +2,15 @@
  * here. */
 #include "core/daemon_state.h"
 #include "core/log_line.h"
+#include "core/log_local_syslog.h"
 #include "core/log_options.h"
 #include "core/log_process.h"
 #include "core/log_tools.h"
+#include "handlers/bsp_module_level.h"
 #include "protocol/json_memory.h"
 #include "transport/log_server.h"
 
 #include <charconv>
-#include <cstdio>
 #include <unistd.h>
 
 namespace
@@ -49,10 +50,7 @@ void start_system_log()
     vex_get_nv_item("syslog_path", path, sizeof path);
     vex_get_nv_item("syslog_level", level, sizeof level);
     vex_get_nv_item("syslog_size", size, sizeof size);
-    char cmd[256] = {};
-    std::snprintf(cmd, sizeof cmd, "sh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o %s -l %s -s %s ", path, level,
-                  size);
-    log_exec_cmd(cmd);
+    log_run_syslog_script(path, level, size, log_script_wait::yes);
 }
 
 void run_server_mode()
@@ -79,6 +77,7 @@ int main(int argc, char **argv)
         return 0;
     if (!consume_start())
         return 0;
+    log_restore_bsp_module_level();
     g_daemon.run_mode = read_run_mode();
     if (g_daemon.run_mode != 0) {
         LOG_FAULT("client mode is not part of this build, nothing to do\n");

@@ -28,9 +28,13 @@ bool log_handler_entered(const char *name, const char *control, const unsigned c
     return true;
 }
 
-json_tree log_handler_parse(const char *name, const char *control)
+void log_handler_received(const char *name, const char *control)
 {
     LOG_NOTE("%s:recv jsonstr = %s", name, control);
+}
+
+json_tree log_handler_parse(const char *control)
+{
     json_tree request = log_json_parse(control);
     if (!request)
         LOG_NOTE("cJSON_Parse error\n");
@@ -40,6 +44,15 @@ json_tree log_handler_parse(const char *name, const char *control)
 const char *log_member_text(const cJSON *object, const char *name)
 {
     return cJSON_GetStringValue(cJSON_GetObjectItem(object, name));
+}
+
+const cJSON *log_member_object(const cJSON *object, const char *name, const char *what)
+{
+    const cJSON *member = cJSON_GetObjectItem(object, name);
+    if (cJSON_IsObject(member))
+        return member;
+    LOG_NOTE("cannot find %s item\n", what);
+    return nullptr;
 }
 
 void log_reply_text(const char *control)

@@ -5,21 +5,38 @@
 #include "platform/vex_platform.h"
 #include "protocol/json_tree.h"
 
+#include <cstddef>
+#include <cstdio>
+
 constexpr char kLogSource[] = "log_json_codec";
 
 constexpr char kSuccess[] = "Success";
 constexpr char kInternalError[] = "Fail:Device internal error";
+constexpr char kParameterError[] = "Fail:parameter error";
 
 /* Entry check of the handler `name`: false, after a log line, when there is no control text or data to look
  * at. */
 bool log_handler_entered(const char *name, const char *control, const unsigned char *data);
 
-/* Logs the request to the handler `name` and parses it; null, after a log line, when it is not JSON. */
-json_tree log_handler_parse(const char *name, const char *control);
+/* Logs what the handler `name` was sent. */
+void log_handler_received(const char *name, const char *control);
+
+/* Parses the request; null, after a log line, when it is not JSON. */
+json_tree log_handler_parse(const char *control);
 
 /* The text of a string member, letter case of its name ignored; null when it is missing or of another type.
  * The text lives as long as the tree. */
 const char *log_member_text(const cJSON *object, const char *name);
+
+/* The object member, letter case of its name ignored; null, after the log line "cannot find WHAT item", when it is
+ * missing or no object. */
+const cJSON *log_member_object(const cJSON *object, const char *name, const char *what);
+
+/* Copies as much of a text as the field holds with its NUL. */
+template <std::size_t size> void log_keep_text(char (&field)[size], const char *text)
+{
+    std::snprintf(field, size, "%s", text);
+}
 
 /* Sends a control text on the command connection; what becomes of it is nobody's concern. */
 void log_reply_text(const char *control);

@@ -1,8 +1,8 @@
 #include "core/log_line.h"
+#include "core/log_local_syslog.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
-#include "handlers/syslog_size.h"
 
 #include <cstdio>
 #include <cstdlib>
@@ -60,7 +60,7 @@ int log_msg_get_version_info(const char *control, const unsigned char *data, std
 {
     if (!log_handler_entered(__func__, control, data))
         return -1;
-    LOG_NOTE("%s:recv jsonstr = %s", __func__, control);
+    log_handler_received(__func__, control);
     const json_tree root{cJSON_CreateObject()};
     if (!root) {
         LOG_NOTE("cjson create root fail\n");

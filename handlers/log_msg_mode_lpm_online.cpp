@@ -37,7 +37,8 @@ int log_msg_mode_lpm_online(const char *control, const unsigned char *data, std:
 {
     if (!log_handler_entered(__func__, control, data))
         return -1;
-    const json_tree request = log_handler_parse(__func__, control);
+    log_handler_received(__func__, control);
+    const json_tree request = log_handler_parse(control);
     if (!request)
         return -1;
     const char *mode = log_member_text(request.get(), "mode_lpm_online");
@@ -54,6 +55,6 @@ int log_msg_mode_lpm_online(const char *control, const unsigned char *data, std:
     else if (std::strcmp(mode, "online") == 0)
         switch_mode("online", kCmdOnline);
     else
-        reply("", "Fail:parameter error");
+        reply("", kParameterError);
     return 0;
 }

@@ -9,7 +9,6 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <fstream>
-#include <gtest/gtest.h>
 #include <netdb.h>
 #include <poll.h>
 #include <sstream>
@@ -38,6 +37,14 @@ bool receive_exactly(int fd, std::size_t count, std::string &out)
 
 } // namespace
 
+const std::string kAskMode = R"({"msgid":"11","mode_lpm_online":""})";
+const std::string kOnline = mode_reply("online", "Success");
+
+std::string mode_reply(const std::string &mode, const std::string &result)
+{
+    return R"({"msgid":"11","mode_lpm_online":")" + mode + R"(","Result":")" + result + R"("})";
+}
+
 tool_connection::tool_connection(const char *address)
 {
     addrinfo *to = nullptr;
@@ -56,7 +63,7 @@ void tool_connection::send(const std::string &bytes) const
     EXPECT_EQ(static_cast<ssize_t>(bytes.size()), ::send(fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL));
 }
 
-std::string tool_connection::receive() const
+std::string tool_connection::receive(std::string *data) const
 {
     const auto number = [](const std::string &s) {
         std::uint32_t n = 0;
@@ -68,12 +75,14 @@ std::string tool_connection::receive() const
         !receive_exactly(fd.get(), number(length), control) || !receive_exactly(fd.get(), 4, length) ||
         !receive_exactly(fd.get(), number(length) + 2, rest))
         return "(closed)";
-    return head == "#~" && rest == "~#" ? control : "(no frame)";
+    if (data != nullptr)
+        *data = rest.substr(0, rest.size() - 2);
+    return head == "#~" && rest.ends_with("~#") ? control : "(no frame)";
 }
 
-std::string tool_connection::ask(const std::string &control) const
+std::string tool_connection::ask(const std::string &control, const std::string &data) const
 {
-    send(frame(control));
+    send(frame(control, data));
     return receive();
 }
 
@@ -137,6 +146,20 @@ long daemon_process::logged(const std::string &text) const
     return count;
 }
 
+std::string daemon_process::commands()
+{
+    constexpr char kMark[] = " cmdStr[";
+    const std::string all = log();
+    std::string found;
+    for (std::size_t at = commands_seen_; (at = all.find(kMark, at)) != std::string::npos;) {
+        at += std::strlen(kMark);
+        const std::size_t end = all.find("]\n", at);
+        found += all.substr(at, end - at) + '\n';
+    }
+    commands_seen_ = all.size();
+    return found;
+}
+
 bool daemon_process::logs(const std::string &text, long count) const
 {
     const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
@@ -159,6 +182,26 @@ bool daemon_process::waits_in(long syscall) const
             return true;
     }
     return false;
+}
+
+void Daemon::start(bool streams)
+{
+    daemon_ = std::make_unique<daemon_process>(std::vector<std::string>{}, streams);
+    daemon_->wait_listening();
+    descriptors_ = entries(daemon_->proc("fd"));
+    threads_ = entries(daemon_->proc("task"));
+}
+
+bool Daemon::settles(std::size_t more_descriptors, std::size_t more_threads) const
+{
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
+    while (entries(daemon_->proc("fd")) != descriptors_ + more_descriptors ||
+           entries(daemon_->proc("task")) != threads_ + more_threads) {
+        if (std::chrono::steady_clock::now() > end)
+            return false;
+        std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
+    }
+    return true;
 }
 
 std::size_t entries(const std::string &dir)
@@ -187,8 +230,8 @@ std::string get_nv(const std::string &name)
 
 void install_program(const std::string &name, const std::string &script)
 {
-    std::ofstream("/usr/vex/bin/" + name) << "#!/bin/sh\n" << script;
-    EXPECT_EQ(0, chmod(("/usr/vex/bin/" + name).c_str(), 0755));
+    std::ofstream("/usr/vex/override/" + name) << "#!/bin/sh\n" << script;
+    EXPECT_EQ(0, chmod(("/usr/vex/override/" + name).c_str(), 0755));
 }
 
 std::string run_command(const std::string &command, int *status)

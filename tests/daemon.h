@@ -7,6 +7,8 @@
 
 #include "platform/unique_fd.h"
 
+#include <gtest/gtest.h>
+#include <memory>
 #include <string>
 #include <sys/types.h>
 #include <vector>
@@ -17,8 +19,9 @@ constexpr int kPatience = 30000; /* milliseconds */
 struct tool_connection {
     explicit tool_connection(const char *address = "127.0.0.1");
     void send(const std::string &bytes) const;
-    std::string receive() const; /* the control text of the next frame; "(closed)" when there is none */
-    std::string ask(const std::string &control) const;
+    /* The control text, and the data, of the next frame; "(closed)" when there is none. */
+    std::string receive(std::string *data = nullptr) const;
+    std::string ask(const std::string &control, const std::string &data = "") const;
     unique_fd fd;
 };
 
@@ -35,6 +38,8 @@ public:
     /* All log lines, and how many of them hold the text. */
     std::string log() const;
     long logged(const std::string &text) const;
+    /* The shell lines it has run since this was asked last, each with a newline. */
+    std::string commands();
     /* Waits until so many do. */
     bool logs(const std::string &text, long count = 1) const;
     std::string proc(const char *name) const { return "/proc/" + std::to_string(pid) + '/' + name; }
@@ -45,7 +50,26 @@ public:
 
 private:
     unique_fd log_changes_;
+    std::size_t commands_seen_ = 0;
 };
+
+/* A daemon on its device, and what it had when it was at rest. */
+class Daemon : public testing::Test
+{
+protected:
+    void start(bool streams = true);
+    /* Whether it comes to have as many descriptors and threads as at its start, and so many more. */
+    bool settles(std::size_t more_descriptors = 0, std::size_t more_threads = 0) const;
+
+    std::unique_ptr<daemon_process> daemon_;
+    std::size_t descriptors_ = 0;
+    std::size_t threads_ = 0;
+};
+
+/* A command that runs no program, and its reply. */
+extern const std::string kAskMode;
+extern const std::string kOnline;
+std::string mode_reply(const std::string &mode, const std::string &result);
 
 std::size_t entries(const std::string &dir);
 std::string read_file(const std::string &path);

@@ -18,44 +18,6 @@ namespace
 {
 
 const std::string kAskVersion = R"({"msgid":"3","VersionInfo":""})";
-const std::string kAskMode = R"({"msgid":"11","mode_lpm_online":""})";
-
-std::string mode_reply(const std::string &mode, const std::string &result)
-{
-    return R"({"msgid":"11","mode_lpm_online":")" + mode + R"(","Result":")" + result + R"("})";
-}
-
-const std::string kOnline = mode_reply("online", "Success");
-
-class Daemon : public testing::Test
-{
-protected:
-    void start(bool streams = true)
-    {
-        daemon_ = std::make_unique<daemon_process>(std::vector<std::string>{}, streams);
-        daemon_->wait_listening();
-        descriptors_ = entries(daemon_->proc("fd"));
-        threads_ = entries(daemon_->proc("task"));
-    }
-
-    /* Whether it comes to have as many descriptors and threads as at its start, and so many more. */
-    bool settles(std::size_t more_descriptors = 0, std::size_t more_threads = 0) const
-    {
-        const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
-        while (entries(daemon_->proc("fd")) != descriptors_ + more_descriptors ||
-               entries(daemon_->proc("task")) != threads_ + more_threads) {
-            if (std::chrono::steady_clock::now() > end)
-                return false;
-            std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
-        }
-        return true;
-    }
-
-    std::unique_ptr<daemon_process> daemon_;
-    std::size_t descriptors_ = 0;
-    std::size_t threads_ = 0;
-};
-
 TEST_F(Daemon, StartConsumesOneUnitOfItsCounter)
 {
     set_nv("syslog_size", "");

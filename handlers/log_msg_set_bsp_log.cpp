@@ -1,0 +1,74 @@
+#include "core/log_line.h"
+#include "handlers/bsp_module_level.h"
+#include "handlers/handlers.h"
+#include "handlers/log_handler.h"
+
+namespace
+{
+
+struct bsp_request {
+    const char *name;
+    const char *level; /* empty: which one is set? */
+};
+
+void reply(const char *name, const char *level, const char *result)
+{
+    log_reply("{\"msgid\":\"8\",\"bsp\":{\"module_name\":\"%s\",\"level\":\"%s\"},\"Result\":\"%s\"}", name, level,
+              result);
+}
+
+/* Reads the request, whose texts live as long as its tree; false, after a log line, when it is not complete. */
+bool read_request(const cJSON *tree, bsp_request *request)
+{
+    const cJSON *bsp = log_member_object(tree, "bsp", "K_bspLogSet");
+    if (bsp == nullptr)
+        return false;
+    request->name = log_member_text(bsp, "module_name");
+    if (request->name != nullptr)
+        LOG_NOTE("bsp module_name = %s\n", request->name);
+    else
+        LOG_NOTE("cannot find K_bspModuleName item\n");
+    request->level = log_member_text(bsp, "level");
+    if (request->level != nullptr)
+        LOG_NOTE("bsp_reqmodulelevel = %s\n", request->level);
+    else
+        LOG_NOTE("cannot find K_bspModuleLevel item\n");
+    return request->name != nullptr && request->level != nullptr;
+}
+
+void serve(const bsp_request &request)
+{
+    const bool query = *request.level == '\0';
+    if (*request.name == '\0') {
+        reply("", "", "Fail:unkonw bsp module name");
+    } else if (!log_bsp_text_allowed(request.name) || (!query && !log_bsp_text_allowed(request.level))) {
+        reply("", "", kParameterError);
+    } else if (query) {
+        char level[kBspFieldSize];
+        log_get_bsp_module_level(request.name, level);
+        reply(request.name, level, kSuccess);
+    } else if (log_set_bsp_module_level(request.name, request.level) != 0) {
+        reply("", "", kParameterError);
+    } else {
+        log_apply_bsp_module_level(request.name, request.level);
+        reply(request.name, request.level, kSuccess);
+    }
+}
+
+} // namespace
+
+int log_msg_set_bsp_log(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
+{
+    if (!log_handler_entered(__func__, control, data))
+        return -1;
+    log_handler_received(__func__, control);
+    const json_tree tree = log_handler_parse(control);
+    if (!tree)
+        return -1;
+    bsp_request request{};
+    if (read_request(tree.get(), &request))
+        serve(request);
+    else
+        reply("", "", kInternalError);
+    return 0;
+}
