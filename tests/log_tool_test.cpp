@@ -51,6 +51,111 @@ TEST(LogTool, ShowsTheDeviceToPeopleAndScripts)
     EXPECT_EQ(1, status);
 }
 
+TEST(LogTool, DoesEverythingOnARealDevice)
+{
+    daemon_process daemon;
+    daemon.wait_listening();
+    const auto says = [](const std::string &command, const std::string &words) {
+        int status = -1;
+        const std::string out = run_command("vex_log_tool " + command, &status);
+        EXPECT_EQ(0, status) << command;
+        EXPECT_NE(std::string::npos, out.find(words)) << command << '\n' << out;
+    };
+    says("syslog", "System log: level 7, size 512 KB, at most 20480 KB\n");
+    says("syslog 5 64", "System log: level 5, size 64 KB from now on\n");
+    says("bsp usb err", "Kernel module usb: log level err from now on\n");
+    says("bsp usb", "Kernel module usb: log level err\n");
+    says("modem", "The modem is set to: online\n");
+    says("capture start lan,lo --len 100", "told to capture on lan,lo.");
+    says("--json capture start lan,lo",
+         R"({"msgid":"5","tcpdump":{"interfaceName":"","Action":""},"Result":"Success"})");
+    run_command("until [ -e /logfs/lo.pcap ] && [ -e /logfs/bridge0.pcap ]; do sleep 0.01; done");
+    says("version", "VX-520");
+    run_command("until [ $(stat -c %s /logfs/lo.pcap) -gt 24 ]; do killall -USR2 tcpdump; sleep 0.01; done");
+    says("capture stop", "stopped");
+    run_command("while pidof tcpdump; do sleep 0.01; done; head -c 1500000 /dev/urandom >/logfs/noise");
+    says("archive /tmp/a.tgz", "bytes\n  capture logfs/");
+    EXPECT_EQ("", run_command("killall syslogd; mkdir /tmp/x && tar -xzf /tmp/a.tgz -C /tmp/x && rm /logfs/syslog "
+                              "/tmp/x/logfs/syslog && diff -r /logfs /tmp/x/logfs"));
+    EXPECT_NE("", run_command("tcpdump -r /logfs/lo.pcap port 48888 2>/dev/null"));
+    run_command("mkdir -p /tmp/p/conf && touch /tmp/p/conf/Diag.cfg && tar -cf /tmp/p.tar -C /tmp/p conf");
+    says("config /tmp/p.tar", "The device has taken the package of 10240 bytes.");
+    EXPECT_EQ("Diag.cfg\n", run_command("ls /logfs/logconf"));
+    says("stream qxdm --for 0.2 --output /tmp/q", "of the log received.");
+    EXPECT_EQ("DIAG", read_file("/tmp/q").substr(0, 4));
+    says("clean", "told to delete");
+    EXPECT_EQ("", run_command("ls /logfs"));
+}
+
+TEST(LogTool, ShowsTheLiveLogUntilItIsStopped)
+{
+    daemon_process daemon;
+    daemon.wait_listening();
+    run_command("mkfifo /tmp/out /tmp/err");
+    for (const char *host : {"192.168.0.1", "::1"}) {
+        /* Lines are logged until the tool shows one; then it is stopped. */
+        const std::string out = run_command("vex_log_tool stream syslog --host " + std::string(host) +
+                                            " >/tmp/out 2>/tmp/err & tool=$!; exec 3</tmp/out 4</tmp/err; "
+                                            "while :; do logger hello; sleep 0.02; done & "
+                                            "read line <&3; kill $!; kill -INT $tool; wait $tool; "
+                                            "echo $? $line; cat <&4");
+        EXPECT_NE(std::string::npos, out.find("hello\n")) << out;
+        EXPECT_EQ(0u, out.find("0 <")) << out;
+        EXPECT_NE(std::string::npos, out.find(" bytes of the log received.")) << out;
+        EXPECT_TRUE(daemon.commands().ends_with("vex_syslog.sh -L -o /logfs -l 7 -s 512 &\n"));
+    }
+    /* Another tool takes the device over. */
+    const std::string out =
+        run_command("vex_log_tool stream syslog >/tmp/out 2>/tmp/err & cat /tmp/out & "
+                    "exec 4</tmp/err; read told <&4; vex_log_tool modem >/dev/null; wait $!; cat <&4");
+    EXPECT_NE(std::string::npos, out.find("Another log tool may have taken it over")) << out;
+    EXPECT_TRUE(daemon.commands().ends_with(":1514 &\n")); /* nobody fights: no stop */
+}
+
+std::string piece(const std::string &total, const std::string &data)
+{
+    return frame(R"({"msgid":"2","GetLocalLog":{"totalLength":")" + total + R"("},"Result":"Success"})", data);
+}
+
+TEST(LogTool, StoresNothingButWholeArchives)
+{
+    const std::string not_packed =
+        frame(R"({"msgid":"2","GetLocalLog":{"totalLength":"0"},"Result":"Fail:Compressed logfs error"})");
+    run_command("mkdir /tmp/d; echo hello >/tmp/hello; tar -czf /tmp/good.tgz -C /tmp hello");
+    const std::string good = read_file("/tmp/good.tgz");
+    const std::string size = std::to_string(good.size());
+    const struct {
+        std::string says;
+        int status;
+        const char *words;
+    } cases[] = {
+        {piece(size, good.substr(0, 50)) + piece(size, good.substr(50)), 0, "/tmp/d/a: 1 files\n"},
+        {not_packed + piece(size, good), 0, "could not pack its logs. Most likely one of them changed"},
+        {not_packed + not_packed, 1, "vex_log_tool: the device could not pack its logs."},
+        {frame(R"({"msgid":"2","Result":"Fail:Open log file error"})"), 1, "answered \"Fail:Open log file error\""},
+        {piece(size, good.substr(0, 50)) + piece("9999", good.substr(50)), 1, "do not fit together"},
+        {piece("60", good), 1, "do not fit together"},
+        {piece("0", ""), 1, "do not fit together"},
+        {piece(size, good.substr(0, 50)), 2, "ended before the answer was there"},
+        {piece("9", "no gzip!!"), 1, "is no readable gzip tar: Unrecognized archive format"},
+        {piece("90", good.substr(0, 90)), 1, "is no readable gzip tar: truncated gzip input"},
+    };
+    for (const auto &c : cases) {
+        const fake_device device(c.says, false);
+        int status = -1;
+        const std::string out =
+            run_command("vex_log_tool archive /tmp/d/a --tries 2 --host 127.0.0.1 --port " + device.port, &status);
+        EXPECT_EQ(c.status, status) << out;
+        EXPECT_NE(std::string::npos, out.find(c.words)) << c.words << '\n' << out;
+        EXPECT_EQ(c.status == 0 ? "a\n" : "", run_command("ls /tmp/d; rm -f /tmp/d/*"));
+    }
+    const fake_device slow(piece(size, good.substr(0, 50)), true);
+    EXPECT_EQ("2 vex_log_tool: interrupted\n",
+              run_command("vex_log_tool archive /tmp/d/a --host 127.0.0.1 --port " + slow.port +
+                          " 2>/tmp/said & until [ -s /tmp/d/a.* ]; do sleep 0.01; done; kill -INT $!; wait $!; "
+                          "echo -n $? ''; grep -v received /tmp/said; ls /tmp/d"));
+}
+
 TEST(LogTool, SaysWhatWentWrongAndWhere)
 {
     const std::string whole = frame(R"({"msgid":"3","Result":"Success"})");

@@ -17,20 +17,22 @@ std::string tool_printable(const std::string &text)
 tool_answer tool_read_answer(const std::string &control)
 {
     if (control.empty())
-        return {tool_verdict::refused, "the device refused the request: it does not know such a command", nullptr};
+        return {tool_verdict::refused, "the device refused the request: it does not know such a command", nullptr,
+                control};
     json_tree root{cJSON_ParseWithLength(control.data(), control.size())};
     const char *result = cJSON_GetStringValue(cJSON_GetObjectItem(root.get(), "Result"));
     if (result == nullptr)
-        return {tool_verdict::garbled, "the device's reply has no result: " + tool_printable(control), std::move(root)};
+        return {tool_verdict::garbled, "the device's reply has no result: " + tool_printable(control), std::move(root),
+                control};
     const std::string said = result;
     if (said == "Success")
-        return {tool_verdict::success, "", std::move(root)};
-    return {tool_verdict::failed, "the device answered \"" + tool_printable(said) + '"', std::move(root)};
+        return {tool_verdict::success, "", std::move(root), control};
+    return {tool_verdict::failed, "the device answered \"" + tool_printable(said) + '"', std::move(root), control};
 }
 
 std::string tool_answer_text(const tool_answer &answer, const char *group, const char *name)
 {
-    const cJSON *object = cJSON_GetObjectItem(answer.root.get(), group);
+    const cJSON *object = group != nullptr ? cJSON_GetObjectItem(answer.root.get(), group) : answer.root.get();
     const char *text = cJSON_GetStringValue(cJSON_GetObjectItem(object, name));
     return text != nullptr ? tool_printable(text) : "";
 }

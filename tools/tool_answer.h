@@ -15,8 +15,9 @@ enum class tool_verdict {
 
 struct tool_answer {
     tool_verdict verdict;
-    std::string reason; /* a sentence for a person; empty after success */
-    json_tree root;     /* the reply, where it is JSON */
+    std::string reason;  /* a sentence for a person; empty after success */
+    json_tree root;      /* the reply, where it is JSON */
+    std::string control; /* the reply as it came */
 };
 
 /* The text as a terminal may show it: control bytes, which could command the terminal, as \xNN. */
@@ -25,7 +26,8 @@ std::string tool_printable(const std::string &text);
 /* Judges the control text of a reply. */
 tool_answer tool_read_answer(const std::string &control);
 
-/* The printable text of the reply's member `name` inside its member `group`; empty when there is none. */
+/* The printable text of the reply's member `name` inside its member `group`, or of its own where that is null; empty
+ * when there is none. */
 std::string tool_answer_text(const tool_answer &answer, const char *group, const char *name);
 
 #endif

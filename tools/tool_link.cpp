@@ -1,6 +1,6 @@
 #include "tools/tool_link.h"
 
-#include "protocol/log_pkg_codec.h"
+#include "tools/tool_wait.h"
 
 #include <cerrno>
 #include <cstring>
@@ -9,13 +9,10 @@
 #include <netdb.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
-#include <poll.h>
 #include <sys/socket.h>
 
 namespace
 {
-
-using clock_type = std::chrono::steady_clock;
 
 struct address_list_deleter {
     void operator()(addrinfo *list) const { freeaddrinfo(list); }
@@ -23,37 +20,24 @@ struct address_list_deleter {
 
 using address_list = std::unique_ptr<addrinfo, address_list_deleter>;
 
-std::string seconds(std::chrono::milliseconds limit)
+/* Waits until the socket is ready for `events`; false, and `why` where it is not the time, when it is not. */
+bool wait_ready(int fd, short events, tool_clock::time_point end, std::string &why)
 {
-    const auto ms = limit.count();
-    std::string text = std::to_string(ms / 1000);
-    if (ms % 1000 != 0)
-        text += '.' + std::to_string(ms % 1000 + 1000).substr(1);
-    return text + " s";
-}
-
-/* Waits until the socket is ready for `events` or the time has come; false when it has come. */
-bool wait_ready(int fd, short events, clock_type::time_point end)
-{
-    for (;;) {
-        const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - clock_type::now());
-        pollfd entry{fd, events, 0};
-        const int n = poll(&entry, 1, left.count() > 0 ? static_cast<int>(left.count()) : 0);
-        if (n > 0)
-            return true;
-        if (n == 0 || errno != EINTR)
-            return false;
-    }
+    pollfd entry{fd, events, 0};
+    const tool_wait event = tool_wait_for({&entry, 1}, end);
+    if (event == tool_wait::interrupted)
+        why = "interrupted";
+    return event == tool_wait::ready;
 }
 
 /* A connected non-blocking socket to one address; none on failure, and the error's text unless it was the time. */
-unique_fd connect_one(const addrinfo &address, clock_type::time_point end, std::string &error)
+unique_fd connect_one(const addrinfo &address, tool_clock::time_point end, std::string &error)
 {
     unique_fd sock{socket(address.ai_family, address.ai_socktype | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
     int failure = 0;
     if (!sock || (connect(sock.get(), address.ai_addr, address.ai_addrlen) != 0 && errno != EINPROGRESS)) {
         failure = errno;
-    } else if (!wait_ready(sock.get(), POLLOUT, end)) {
+    } else if (!wait_ready(sock.get(), POLLOUT, end, error)) {
         return {};
     } else {
         socklen_t len = sizeof failure;
@@ -94,29 +78,29 @@ std::optional<std::size_t> frame_length(const std::vector<unsigned char> &held)
 /* Takes the frame of `len` bytes off the held bytes. */
 std::optional<tool_frame> take_frame(tool_link &link, std::size_t len)
 {
-    const auto msg = std::make_unique<log_msg>();
-    if (log_decode_msg(link.held.data(), len, msg.get()) != 0)
+    log_msg *const msg = link.msg.get();
+    log_msg_clear(msg);
+    if (log_decode_msg(link.held.data(), len, msg) != 0)
         return std::nullopt;
-    tool_frame frame;
-    frame.control.assign(msg->control, static_cast<std::size_t>(msg->controlLen));
-    frame.data.assign(msg->data, msg->data + msg->dataLen);
     link.held.erase(link.held.begin(), link.held.begin() + static_cast<std::ptrdiff_t>(len));
-    return frame;
+    return tool_frame{{msg->control, static_cast<std::size_t>(msg->controlLen)},
+                      {msg->data, static_cast<std::size_t>(msg->dataLen)}};
 }
 
 /* Waits for more bytes and holds them. */
 bool receive_some(tool_link &link, std::string &why)
 {
     const auto limit = link.held.empty() ? link.limits.reply : link.limits.stall;
-    if (!wait_ready(link.fd.get(), POLLIN, clock_type::now() + limit)) {
-        why = link.where + " sent nothing for " + seconds(limit) +
-              (link.held.empty()
-                   ? ". Either it is still at work, then try again with a larger --reply-timeout, or it does "
-                     "not know the command: such a one it leaves unanswered"
-                   : " in the middle of an answer. Try again with a larger --stall-timeout");
+    if (!wait_ready(link.fd.get(), POLLIN, tool_clock::now() + limit, why)) {
+        if (why.empty())
+            why = link.where + " sent nothing for " + tool_seconds(limit) +
+                  (link.held.empty()
+                       ? ". Either it is still at work, then try again with a larger --reply-timeout, or it does "
+                         "not know the command: such a one it leaves unanswered"
+                       : " in the middle of an answer. Try again with a larger --stall-timeout");
         return false;
     }
-    unsigned char piece[16384];
+    unsigned char piece[65536];
     const ssize_t n = recv(link.fd.get(), piece, sizeof piece, 0);
     if (n > 0)
         link.held.insert(link.held.end(), piece, piece + n);
@@ -141,28 +125,29 @@ std::optional<tool_link> tool_connect(const std::string &host, const std::string
         return std::nullopt;
     }
     const address_list addresses{found};
-    const auto end = clock_type::now() + limits.connect;
-    std::string error = "no answer within " + seconds(limits.connect);
+    const auto end = tool_clock::now() + limits.connect;
+    std::string error = "no answer within " + tool_seconds(limits.connect);
     for (const addrinfo *at = addresses.get(); at != nullptr; at = at->ai_next) {
         unique_fd sock = connect_one(*at, end, error);
         if (!sock)
             continue;
         const int on = 1;
         setsockopt(sock.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
-        return tool_link{std::move(sock), where, limits, {}};
+        return tool_link{.fd = std::move(sock), .where = where, .limits = limits, .held = {}};
     }
     why = "cannot connect to " + where + ": " + error +
           ". Check the address, and that the device is on and its log daemon runs in server mode";
     return std::nullopt;
 }
 
-bool tool_send(tool_link &link, const std::string &control, std::string &why)
+bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why)
 {
-    const auto msg = std::make_unique<log_msg>();
     std::vector<unsigned char> frame(kPkgSendBuf);
     auto len = static_cast<std::int32_t>(frame.size());
-    if (log_encode_fill_msg(control.c_str(), "", 0, msg.get()) != 0 ||
-        log_encode_pkg_buf(frame.data(), &len, msg.get()) != 0) {
+    const void *const bytes = data.empty() ? "" : static_cast<const void *>(data.data());
+    log_msg_clear(link.msg.get());
+    if (log_encode_fill_msg(control.c_str(), bytes, static_cast<std::int32_t>(data.size()), link.msg.get()) != 0 ||
+        log_encode_pkg_buf(frame.data(), &len, link.msg.get()) != 0) {
         why = "the command has " + std::to_string(control.size()) + " characters; " + std::to_string(kPkgControlMax) +
               " is the most";
         return false;
@@ -174,9 +159,10 @@ bool tool_send(tool_link &link, const std::string &control, std::string &why)
         } else if (errno != EAGAIN && errno != EINTR) {
             why = ended(link, std::strerror(errno));
             return false;
-        } else if (!wait_ready(link.fd.get(), POLLOUT, clock_type::now() + link.limits.stall)) {
-            why = link.where + " took nothing for " + seconds(link.limits.stall) +
-                  ". It may be busy with another command: try again with a larger --stall-timeout";
+        } else if (!wait_ready(link.fd.get(), POLLOUT, tool_clock::now() + link.limits.stall, why)) {
+            if (why.empty())
+                why = link.where + " took nothing for " + tool_seconds(link.limits.stall) +
+                      ". It may be busy with another command: try again with a larger --stall-timeout";
             return false;
         }
     }

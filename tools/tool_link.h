@@ -8,9 +8,12 @@
 #define TOOLS_TOOL_LINK_H
 
 #include "platform/unique_fd.h"
+#include "protocol/log_pkg_codec.h"
 
 #include <chrono>
+#include <memory>
 #include <optional>
+#include <span>
 #include <string>
 #include <vector>
 
@@ -24,20 +27,21 @@ struct tool_link {
     unique_fd fd;
     std::string where; /* the device's address and port, for messages */
     tool_limits limits;
-    std::vector<unsigned char> held; /* received bytes behind the frames that were taken */
+    std::vector<unsigned char> held;                            /* received bytes behind the frames that were taken */
+    std::unique_ptr<log_msg> msg = std::make_unique<log_msg>(); /* the frame being sent, or taken last */
 };
 
 struct tool_frame {
     std::string control;
-    std::vector<unsigned char> data;
+    std::span<const unsigned char> data; /* the link's, until it is used again */
 };
 
 /* Connects to the first address of `host` that accepts. */
 std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
                                       std::string &why);
 
-/* Sends one frame without data. */
-bool tool_send(tool_link &link, const std::string &control, std::string &why);
+/* Sends one frame. */
+bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why);
 
 /* Waits for the next frame. */
 std::optional<tool_frame> tool_receive(tool_link &link, std::string &why);

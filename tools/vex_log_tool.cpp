@@ -1,82 +1,18 @@
-/* The PC side: asks a device's log daemon for one thing and says in words, or as JSON, what came of it. */
-#include "tools/tool_answer.h"
-#include "tools/tool_link.h"
+/* The PC side's command line: which device, and the one thing that is asked of it. */
+#include "tools/tool_archive.h"
+#include "tools/tool_commands.h"
+#include "tools/tool_config.h"
 #include "tools/tool_log.h"
+#include "tools/tool_stream.h"
 
 #include <CLI/CLI.hpp>
-#include <cstdio>
 #include <functional>
 
 namespace
 {
 
-/* Exit statuses beside those of the command line parser, which are above 100. */
-constexpr int kDone = 0;
-constexpr int kDeviceSaidNo = 1;
-constexpr int kNoAnswer = 2;
-
-struct tool_options {
-    std::string host = "192.168.0.1";
-    std::string port = "48888";
-    tool_limits limits;
-    bool json = false;
-};
-
-int fail(int status, const std::string &why)
-{
-    std::fflush(stdout); /* first the reply, then what is wrong with it */
-    std::fprintf(stderr, "vex_log_tool: %s\n", why.c_str());
-    return status;
-}
-
-/* Sends one command and waits for its reply; `show` prints a good one for a person. */
-int ask(const tool_options &options, const std::string &command,
-        const std::function<void(const tool_link &, const tool_answer &)> &show)
-{
-    std::string why;
-    std::optional<tool_link> link = tool_connect(options.host, options.port, options.limits, why);
-    if (!link || !tool_send(*link, command, why))
-        return fail(kNoAnswer, why);
-    const std::optional<tool_frame> frame = tool_receive(*link, why);
-    if (!frame)
-        return fail(kNoAnswer, why);
-    const tool_answer answer = tool_read_answer(frame->control);
-    if (options.json && !frame->control.empty())
-        std::printf("%s\n", frame->control.c_str());
-    if (answer.verdict != tool_verdict::success)
-        return fail(kDeviceSaidNo, answer.reason);
-    if (!options.json)
-        show(*link, answer);
-    return kDone;
-}
-
-void show_version(const tool_link &link, const tool_answer &answer)
-{
-    const auto row = [&answer](const char *title, const char *member, const char *unit) {
-        const std::string value = tool_answer_text(answer, "VersionInfo", member);
-        std::printf("  %-18s%s%s\n", title, value.empty() ? "(not set)" : value.c_str(), value.empty() ? "" : unit);
-    };
-    std::printf("Device at %s\n", link.where.c_str());
-    row("model", "projectName", "");
-    row("software", "VersionNum", "");
-    row("IMEI", "imei", "");
-    row("kernel built", "CompileTime", "");
-    row("system log, most", "syslogsizeMax", " KB");
-}
-
-int run_version(const tool_options &options)
-{
-    return ask(options, R"({"msgid":"3","VersionInfo":""})", show_version);
-}
-
-int run_raw(const tool_options &options, const std::string &command)
-{
-    return ask(options, command, [](const tool_link &, const tool_answer &answer) {
-        char *printed = cJSON_Print(answer.root.get());
-        std::printf("%s\n", printed != nullptr ? printed : "");
-        cJSON_free(printed);
-    });
-}
+/* What is asked of the device; the exit status. */
+using tool_job = std::function<int(tool_device &)>;
 
 /* An option that takes a limit in seconds. */
 void add_limit(CLI::App &app, const char *name, std::chrono::milliseconds &limit, const char *help)
@@ -89,35 +25,100 @@ void add_limit(CLI::App &app, const char *name, std::chrono::milliseconds &limit
         ->default_str(std::to_string(limit.count() / 1000));
 }
 
-void add_common_options(CLI::App &app, tool_options &options)
+void add_common_options(CLI::App &app, tool_device &device)
 {
-    app.add_option("--host", options.host, "address or name of the device")->capture_default_str();
-    app.add_option("--port", options.port, "port of its log daemon")->capture_default_str();
-    app.add_flag("--json", options.json, "print the device's reply as it came");
+    app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
+    app.add_option("--port", device.port, "port of its log daemon")->capture_default_str();
+    app.add_flag("--json", device.json, "print the device's reply as it came");
     app.add_flag_callback("--debug", tool_log_show, "show on standard error what goes over the wire");
-    add_limit(app, "--connect-timeout", options.limits.connect, "longest wait for a connection");
-    add_limit(app, "--reply-timeout", options.limits.reply, "longest wait for an answer");
-    add_limit(app, "--stall-timeout", options.limits.stall, "longest pause inside a transfer");
+    add_limit(app, "--connect-timeout", device.limits.connect, "longest wait for a connection");
+    add_limit(app, "--reply-timeout", device.limits.reply, "longest wait for an answer");
+    add_limit(app, "--stall-timeout", device.limits.stall, "longest pause inside a transfer");
+}
+
+/* What the command line says beside the command. */
+struct tool_words {
+    std::string first;
+    std::string second;
+    int tries = 3;
+    tool_stream_options stream;
+};
+
+void add_capture(CLI::App &app, tool_words &words, tool_job &job)
+{
+    CLI::App *capture = app.add_subcommand("capture", "capture packets into the device's logs");
+    capture->require_subcommand(1);
+    CLI::App *start = capture->add_subcommand("start", "start anew, on up to four interfaces");
+    start->add_option("INTERFACES", words.first, "such as eth0,wan,lan; wan and lan are the device's own")->required();
+    start->add_option("--len", words.second, "bytes to keep of each packet")->check(CLI::NonNegativeNumber);
+    start->callback(
+        [&] { job = [&](tool_device &device) { return tool_capture_start(device, words.first, words.second); }; });
+    capture->add_subcommand("stop", "stop all captures")->callback([&] { job = tool_capture_stop; });
+}
+
+void add_transfers(CLI::App &app, tool_words &words, tool_job &job)
+{
+    CLI::App *archive = app.add_subcommand("archive", "fetch all the device's logs as a gzip tar");
+    archive->add_option("FILE", words.first, "where to store it")->required();
+    archive->add_option("--tries", words.tries, "how often the device may fail to pack them")
+        ->check(CLI::PositiveNumber)
+        ->capture_default_str();
+    archive->callback(
+        [&] { job = [&](tool_device &device) { return tool_archive(device, words.first, words.tries); }; });
+
+    CLI::App *config = app.add_subcommand("config", "push a configuration package and have it set up");
+    config->add_option("FILE", words.first, "the package, a tar file")->required();
+    config->callback([&] { job = [&](tool_device &device) { return tool_config(device, words.first); }; });
+
+    CLI::App *stream = app.add_subcommand("stream", "show a live log until Ctrl-C");
+    stream->add_option("LOG", words.stream.log, "syslog, or qxdm: the modem's log, which is binary")
+        ->required()
+        ->check(CLI::IsMember({"syslog", "qxdm"}));
+    stream->add_option("--output", words.stream.output, "append it to a file");
+    add_limit(*stream, "--for", words.stream.length, "end by itself after that time");
+    stream->callback([&] { job = [&](tool_device &device) { return tool_stream(device, words.stream); }; });
+}
+
+void add_short_commands(CLI::App &app, tool_words &words, tool_job &job)
+{
+    app.add_subcommand("version", "who the device is")->callback([&] { job = tool_version; });
+    app.add_subcommand("clean", "delete all the device's logs")->callback([&] { job = tool_clean; });
+
+    CLI::App *syslog = app.add_subcommand("syslog", "show or set level and size of the device's system log");
+    CLI::Option *level = syslog->add_option("LEVEL", words.first, "1 to 8: lines of a level below it are kept");
+    level->needs(syslog->add_option("SIZE", words.second, "in KB")->needs(level));
+    syslog->callback(
+        [&] { job = [&](tool_device &device) { return tool_syslog(device, words.first, words.second); }; });
+
+    CLI::App *bsp = app.add_subcommand("bsp", "show or set the log level of a kernel module");
+    bsp->add_option("MODULE", words.first, "its name")->required();
+    bsp->add_option("LEVEL", words.second, "such as debug");
+    bsp->callback([&] { job = [&](tool_device &device) { return tool_bsp(device, words.first, words.second); }; });
+
+    CLI::App *modem = app.add_subcommand("modem", "show or switch the modem's mode");
+    modem->add_option("MODE", words.first, "lpm or online");
+    modem->callback([&] { job = [&](tool_device &device) { return tool_modem(device, words.first); }; });
+
+    CLI::App *raw = app.add_subcommand("raw", "send a command as it is and print the reply");
+    raw->add_option("JSON", words.first, "the command, such as {\"msgid\":\"3\"}")->required();
+    raw->callback([&] { job = [&](tool_device &device) { return tool_raw(device, words.first); }; });
 }
 
 } // namespace
 
 int main(int argc, char **argv)
 {
-    tool_options options;
-    std::string raw;
-    int status = kDone;
+    tool_device device;
+    tool_words words;
+    tool_job job;
     CLI::App app{"Controls and collects the diagnostic logs of a device."};
     app.require_subcommand(1);
     app.fallthrough(); /* common options may stand behind the command too */
-    add_common_options(app, options);
-
-    CLI::App *version = app.add_subcommand("version", "who the device is");
-    version->callback([&] { status = run_version(options); });
-    CLI::App *raw_command = app.add_subcommand("raw", "send a command as it is and print the reply");
-    raw_command->add_option("JSON", raw, "the command, such as {\"msgid\":\"3\"}")->required();
-    raw_command->callback([&] { status = run_raw(options, raw); });
+    add_common_options(app, device);
+    add_short_commands(app, words, job);
+    add_capture(app, words, job);
+    add_transfers(app, words, job);
 
     CLI11_PARSE(app, argc, argv);
-    return status;
+    return job(device);
 }

@@ -1,0 +1,60 @@
+#include "tools/tool_device.h"
+
+#include <cstdio>
+
+int tool_fail(int status, const std::string &why)
+{
+    std::fflush(stdout); /* first the reply, then what is wrong with it */
+    std::fprintf(stderr, "vex_log_tool: %s\n", why.c_str());
+    return status;
+}
+
+bool tool_reach(tool_device &device, std::string &why)
+{
+    if (!device.link)
+        device.link = tool_connect(device.host, device.port, device.limits, why);
+    return device.link.has_value();
+}
+
+std::string tool_command(const char *msgid, const char *group,
+                         std::initializer_list<std::pair<const char *, std::string>> members)
+{
+    const json_tree root{cJSON_CreateObject()};
+    cJSON_AddStringToObject(root.get(), "msgid", msgid);
+    cJSON *const object = group != nullptr ? cJSON_AddObjectToObject(root.get(), group) : root.get();
+    for (const auto &[name, value] : members)
+        cJSON_AddStringToObject(object, name, value.c_str());
+    char *const printed = cJSON_PrintUnformatted(root.get());
+    const std::string text = printed != nullptr ? printed : "";
+    cJSON_free(printed);
+    return text;
+}
+
+std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
+                                         std::span<const unsigned char> data, std::string &why)
+{
+    if (!tool_reach(device, why) || !tool_send(*device.link, command, data, why))
+        return std::nullopt;
+    const std::optional<tool_frame> frame = tool_receive(*device.link, why);
+    if (!frame)
+        return std::nullopt;
+    return tool_read_answer(frame->control);
+}
+
+std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status)
+{
+    std::string why;
+    std::optional<tool_answer> answer = tool_exchange(device, command, {}, why);
+    if (!answer) {
+        status = tool_fail(kNoAnswer, why);
+        return std::nullopt;
+    }
+    if (device.json && !answer->control.empty())
+        std::printf("%s\n", answer->control.c_str());
+    status = kDone;
+    if (answer->verdict != tool_verdict::success)
+        status = tool_fail(kDeviceSaidNo, answer->reason);
+    if (status != kDone || device.json)
+        answer.reset();
+    return answer;
+}

@@ -1,0 +1,47 @@
+/*
+ * The device that the tool's commands are for, and what all commands share. Each command is one procedure that returns
+ * the tool's exit status and has said by then what came of it: a good result on standard output, anything else on
+ * standard error.
+ */
+#ifndef TOOLS_TOOL_DEVICE_H
+#define TOOLS_TOOL_DEVICE_H
+
+#include "tools/tool_answer.h"
+#include "tools/tool_link.h"
+
+#include <initializer_list>
+#include <utility>
+
+/* Exit statuses beside those of the command line parser, which are above 100. */
+constexpr int kDone = 0;
+constexpr int kDeviceSaidNo = 1;
+constexpr int kNoAnswer = 2; /* or something on this side failed */
+
+struct tool_device {
+    std::string host = "192.168.0.1";
+    std::string port = "48888";
+    tool_limits limits;
+    bool json = false;             /* print replies as they came instead of words */
+    std::optional<tool_link> link; /* once it was reached */
+};
+
+/* Says what failed; the status. */
+int tool_fail(int status, const std::string &why);
+
+/* Connects unless there is a connection already. Whatever can be wrong on this side is looked at before: to connect is
+ * to take the device from another tool. */
+bool tool_reach(tool_device &device, std::string &why);
+
+/* The control text of a command: `members` inside the object `group`, or beside "msgid" where that is null. */
+std::string tool_command(const char *msgid, const char *group,
+                         std::initializer_list<std::pair<const char *, std::string>> members);
+
+/* Sends a command and waits for its answer. Nothing, and `why`, when there was none. */
+std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
+                                         std::span<const unsigned char> data, std::string &why);
+
+/* The same for a command that is all there is to do: prints the reply with --json, says what is wrong with it. The
+ * answer where it is a good one that is still to be put in words; else nothing, and `status` to end with. */
+std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status);
+
+#endif
