@@ -34,6 +34,16 @@ constexpr int kRoundTrips = 500;
 constexpr int kConnections = 25;
 constexpr std::uint16_t kDaemonPort = 48888;
 constexpr std::uint16_t kFloorPort = 7777;
+constexpr std::uint16_t kArchiveFloorPort = 7778;
+constexpr std::uint16_t kUploadFloorPort = 7779;
+constexpr std::uint16_t kShellFloorPort = 7780;
+
+constexpr int kTransferRounds = 15;
+constexpr std::size_t kArchiveSize = 256 << 20;
+constexpr int kUploadRounds = 201;
+constexpr int kUploadFrames = 20;
+constexpr std::size_t kUploadSize = 50000;
+constexpr int kShellRounds = 101;
 
 struct command {
     const char *what;
@@ -63,6 +73,12 @@ double now()
 {
     std::perror(what);
     std::exit(1);
+}
+
+void shell(const char *command)
+{
+    if (std::system(command) != 0)
+        give_up(command);
 }
 
 /* A program that runs as long as this lives, its output dropped. */
@@ -189,6 +205,102 @@ void measure_connections(const command &command)
                 per_s.floor, per_s.daemon / per_s.floor);
 }
 
+/* Reads frames until the file that they carry is complete; seconds from the first byte on. */
+double read_archive(int fd)
+{
+    static char piece[1 << 18];
+    const std::size_t frames = (kArchiveSize + 51199) / 51200;
+    std::size_t left = 0;
+    double start = 0;
+    do {
+        const ssize_t n = recv(fd, piece, sizeof piece, 0);
+        if (n <= 0)
+            give_up("archive");
+        if (start == 0) { /* the first frame begins here, and all have its control text */
+            start = now();
+            left = kArchiveSize + frames * (12 + static_cast<unsigned char>(piece[5]));
+        }
+        left -= static_cast<std::size_t>(n);
+    } while (left > 0);
+    return now() - start;
+}
+
+/* Largest memory that the process ever had, in KiB. */
+long peak_kib(pid_t pid)
+{
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    for (std::string line; std::getline(status, line);)
+        if (line.rfind("VmHWM:", 0) == 0)
+            return std::stol(line.substr(6));
+    return -1;
+}
+
+/* A stand-in for tar "packs" a file that is already there, so that only the sending counts. */
+void measure_archive(const std::string &floor_server, pid_t daemon_pid)
+{
+    shell("head -c 268435456 /dev/urandom >/tmp/big; printf '#!/bin/sh\\nln /tmp/big $2\\n' "
+          ">/usr/vex/override/tar; chmod 755 /usr/vex/override/tar");
+    const program floor_process({floor_server, "archive", std::to_string(kArchiveFloorPort), "/tmp/big"});
+    const unique_fd daemon = connect_to(kDaemonPort);
+    const unique_fd floor = connect_to(kArchiveFloorPort);
+    const std::string ask = make_command("", R"({"msgid":"2"})", "").frame;
+    const auto fetch = [&ask](int fd) {
+        if (send(fd, ask.data(), ask.size(), 0) != static_cast<ssize_t>(ask.size()))
+            give_up("send");
+        return read_archive(fd);
+    };
+    const long before = peak_kib(daemon_pid);
+    const comparison s = compare(
+        kTransferRounds, [&] { return fetch(daemon.get()); }, [&] { return fetch(floor.get()); });
+    std::printf("archive of 256 MB              %8.0f MB/s   plain program    %8.0f MB/s   ratio %.3f\n",
+                kArchiveSize / s.daemon / 1e6, kArchiveSize / s.floor / 1e6, s.floor / s.daemon);
+    std::printf("  the daemon's peak memory     %8ld KiB, %ld KiB before\n", peak_kib(daemon_pid), before);
+    shell("rm /tmp/big /usr/vex/override/tar");
+}
+
+void measure_upload(const std::string &floor_server)
+{
+    const program floor_process({floor_server, "upload", std::to_string(kUploadFloorPort), "/logfs/floor.tar"});
+    const unique_fd daemon = connect_to(kDaemonPort);
+    const unique_fd floor = connect_to(kUploadFloorPort);
+    const std::string control = R"({"msgid":"1","conf_file":{"totalLength":"2000000000"}})";
+    std::string frame = make_command("", control, "").frame;
+    frame.replace(6 + control.size(), 4, std::string("\0\0\xc3\x50", 4)).insert(10 + control.size(), kUploadSize, 'x');
+    const auto round = [&frame](int fd, std::size_t reply_size, const char *file) {
+        const double us = timed(kUploadFrames, [&] { round_trip(fd, frame, reply_size); });
+        std::filesystem::remove(file);
+        return us;
+    };
+    const std::size_t reply_size =
+        make_command("", "", R"({"msgid":"1","conf_file":{"totalLength":""},"Result":"Success"})").reply_size;
+    const comparison us = compare(
+        kUploadRounds, [&] { return round(daemon.get(), reply_size, "/logfs/logconf.tar"); },
+        [&] { return round(floor.get(), 12, "/logfs/floor.tar"); });
+    std::printf("upload by frames of 50000      %8.0f MB/s   plain program    %8.0f MB/s   ratio %.3f\n",
+                kUploadSize / us.daemon, kUploadSize / us.floor, us.floor / us.daemon);
+}
+
+void measure_first_reply(const std::string &floor_server)
+{
+    const program floor_process({floor_server, "shell", std::to_string(kShellFloorPort),
+                                 "cat /proc/version | cut -d '#' -f 2",
+                                 "df -h | grep /logfs |awk '{print $2}' | cut -d 'M' -f 1"});
+    const unique_fd daemon = connect_to(kDaemonPort);
+    const unique_fd floor = connect_to(kShellFloorPort);
+    const std::string ask = make_command("", R"({"msgid":"3"})", "").frame;
+    const auto first_byte = [&ask](int fd) {
+        return timed(1, [&] {
+            char reply[2048];
+            if (send(fd, ask.data(), ask.size(), 0) < 0 || recv(fd, reply, sizeof reply, 0) <= 0)
+                give_up("first reply");
+        });
+    };
+    const comparison us = compare(
+        kShellRounds, [&] { return first_byte(daemon.get()); }, [&] { return first_byte(floor.get()); });
+    std::printf("first byte of the version      %8.2f ms   its shell lines  %8.2f ms   ratio %.3f\n", us.daemon / 1e3,
+                us.floor / 1e3, us.daemon / us.floor);
+}
+
 /* Sum of the lines "Private_...: N kB" of the process. */
 long private_kib(pid_t pid)
 {
@@ -255,6 +367,9 @@ int main(int argc, char **argv)
             measure_round_trips(command);
             measure_connections(command);
         }
+        measure_first_reply(argv[1]);
+        measure_upload(argv[1]);
+        measure_archive(argv[1], daemon.pid());
     }
     measure_start(argv[1]);
     return 0;

@@ -30,7 +30,7 @@ FILE *log_open_file(const char *path, int mode)
     if (path == nullptr || mode < 0 || mode >= static_cast<int>(std::size(kModes)))
         return nullptr;
     FILE *stream = std::fopen(path, kModes[mode]);
-    if (stream != nullptr && mode != kFileRead && mode != kFileReadBinary)
+    if (stream != nullptr)
         std::setvbuf(stream, nullptr, _IONBF, 0);
     return stream;
 }
@@ -55,14 +55,12 @@ std::int32_t log_write_file_full(FILE *stream, const void *buffer, std::int32_t 
         return 0;
     if (count <= 0)
         return count;
-    std::clearerr(stream);
     std::int32_t written = 0;
     while (written < count) {
         const std::int32_t n = log_write_file(stream, static_cast<const char *>(buffer) + written, count - written);
-        written += n;
-        if (std::ferror(stream) != 0 && errno != EINTR)
+        if (n == 0 && errno != EINTR)
             break;
-        std::clearerr(stream);
+        written += n;
     }
     return written;
 }

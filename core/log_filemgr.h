@@ -21,8 +21,8 @@ constexpr int kFileWriteBinary = 5;      /* "wb" */
 constexpr int kFileWriteReadBinary = 6;  /* "w+b" */
 constexpr int kFileAppendReadBinary = 7; /* "a+b" */
 
-/* The stream, which log_close_file() closes and programs do not inherit; null on failure. One that is written to has no
- * buffer: what counts as written is what the file has taken, so that a full disk is noticed at once. */
+/* The stream, which log_close_file() closes and programs do not inherit; null on failure. It has no buffer: what counts
+ * as written is what the file has taken, so that a full disk is noticed at once, and pieces are not copied. */
 FILE *log_open_file(const char *path, int mode);
 
 /* Reads up to `count` bytes. Bytes read; 0 at the end, on failure, and for null arguments. */

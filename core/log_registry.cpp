@@ -21,6 +21,7 @@ bool g_turn_taken LOG_GUARDED_BY(g_registry_lock);
 pthread_cond_t g_turn_change = PTHREAD_COND_INITIALIZER; /* a turn has ended, or a connection was taken away */
 
 thread_local int t_served_fd = -1; /* the command connection that this thread owns */
+thread_local char t_served_ip[kClientIpSize];
 
 bool stands() LOG_REQUIRES(g_registry_lock)
 {
@@ -60,15 +61,17 @@ void log_cmd_record(int fd, const char *ip)
     std::strncpy(client_ip, ip, sizeof client_ip - 1); /* clears the rest */
 }
 
-void log_cmd_client_ip(char (&ip)[kClientIpSize])
+const char *log_cmd_client_ip()
 {
-    const log_lock hold{g_registry_lock};
-    std::memcpy(ip, client_ip, sizeof ip);
+    return t_served_ip;
 }
 
 void log_cmd_serve(int fd)
 {
     t_served_fd = fd;
+    const log_lock hold{g_registry_lock};
+    if (stands())
+        std::memcpy(t_served_ip, client_ip, sizeof t_served_ip);
 }
 
 bool log_cmd_stands()
@@ -107,17 +110,21 @@ log_cmd_use::log_cmd_use() : sending_(g_cmd_send_lock)
 
 log_cmd_turn::log_cmd_turn()
 {
+    if (t_served_fd == -1) {
+        granted_ = true;
+        return;
+    }
     const log_lock hold{g_registry_lock};
     while (g_turn_taken && stands())
         g_registry_lock.wait(g_turn_change);
-    granted_ = stands();
-    if (granted_)
+    granted_ = taken_ = stands();
+    if (taken_)
         g_turn_taken = true;
 }
 
 log_cmd_turn::~log_cmd_turn()
 {
-    if (!granted_)
+    if (!taken_)
         return;
     {
         const log_lock hold{g_registry_lock};

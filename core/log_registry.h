@@ -59,8 +59,9 @@ int log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
 /* Records a log tool's connection as the command connection. Whoever reads it will own it. */
 void log_cmd_record(int fd, const char *ip) LOG_REQUIRES(g_takeover_lock);
 
-/* Copies the address of the connected log tool. */
-void log_cmd_client_ip(char (&ip)[kClientIpSize]);
+/* The address of the log tool whose command connection the calling thread owns, also when another tool has taken its
+ * place; empty for a thread that owns none. */
+const char *log_cmd_client_ip();
 
 /* Declares the calling thread to be the owner of the command connection `fd`. From now on its commands run,
  * and its replies go out, only while `fd` is still the command connection. A thread that never says so, like
@@ -77,9 +78,9 @@ bool log_cmd_stands();
 void log_cmd_close(int fd);
 
 /*
- * A turn to handle what the command connection has brought. One thread has it at a time: a tool that took another's
- * place waits here until the other's command has ended. A thread whose connection is taken away meanwhile waits no
- * longer; it gets no turn.
+ * A turn to run a command. One tool's thread has it at a time: a tool that took another's place waits here until the
+ * other's command has ended. A thread whose connection is taken away meanwhile waits no longer; it gets no turn. A
+ * thread that owns no command connection runs its commands whenever they come.
  */
 class log_cmd_turn
 {
@@ -92,6 +93,7 @@ public:
 
 private:
     bool granted_ = false;
+    bool taken_ = false; /* and is to be given back */
 };
 
 /* The command connection, held for one frame. fd() is -1 when there is none or this thread has lost its own. */

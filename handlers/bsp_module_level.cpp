@@ -12,9 +12,11 @@ namespace
 constexpr char kItem[] = "bsplog_module_level";
 constexpr int kPiecesMax = 32;
 
-/* One piece of the record. A field too many characters long shows as such: there is room for one more. */
+constexpr std::size_t kTextSize = 64; /* a piece with its NUL */
+
+/* One piece of the record. There is room for one character more than counts, to tell what is too long. */
 struct bsp_entry {
-    char text[64];
+    char text[kTextSize + 1];
     char name[kBspFieldSize + 1];
     char level[kBspFieldSize + 1];
     bool has_level;
@@ -25,11 +27,12 @@ void read_record(char (&record)[kBspRecordSize])
     vex_get_nv_item(kItem, record, sizeof record);
 }
 
-/* Reads a piece, its name and level in fields of `field_size` bytes; false when there is no such piece. */
-bool read_entry(const char *record, int piece, std::size_t field_size, bsp_entry *entry)
+/* Reads a piece, cut to `text_size` bytes, and its name and level, cut to `field_size`; false when there is no such
+ * piece. */
+bool read_entry(const char *record, int piece, std::size_t text_size, std::size_t field_size, bsp_entry *entry)
 {
     *entry = {};
-    if (getNthValueSafe(piece, record, ';', entry->text, sizeof entry->text) != 0)
+    if (getNthValueSafe(piece, record, ';', entry->text, static_cast<int>(text_size)) != 0)
         return false;
     const int size = static_cast<int>(field_size);
     getNthValueSafe(0, entry->text, ',', entry->name, size);
@@ -92,7 +95,7 @@ void log_get_bsp_module_level(const char *name, char (&level)[kBspFieldSize])
     level[0] = '\0';
     bsp_entry entry;
     for (int i = 0; i < kPiecesMax; ++i) {
-        if (!read_entry(record, i, kBspFieldSize, &entry) || std::strcmp(entry.name, name) != 0)
+        if (!read_entry(record, i, kTextSize, kBspFieldSize, &entry) || std::strcmp(entry.name, name) != 0)
             continue;
         LOG_NOTE("find %s item\n", entry.text);
         if (entry.has_level)
@@ -110,7 +113,7 @@ int log_set_bsp_module_level(const char *name, const char *level)
     bool found = false;
     bsp_entry entry;
     for (int i = 0; i < kPiecesMax; ++i)
-        if (read_entry(record, i, sizeof entry.name, &entry) && entry.text[0] != '\0')
+        if (read_entry(record, i, kTextSize, sizeof entry.name, &entry) && entry.text[0] != '\0')
             found = rewrite_entry(entry, name, level, &out) || found;
     if (!found)
         out.append(name, level);
@@ -136,7 +139,7 @@ void log_restore_bsp_module_level()
     read_record(record);
     bsp_entry entry;
     for (int i = 0; i < kPiecesMax; ++i)
-        if (read_entry(record, i, sizeof entry.name, &entry) && log_bsp_text_allowed(entry.name) &&
+        if (read_entry(record, i, sizeof entry.text, sizeof entry.name, &entry) && log_bsp_text_allowed(entry.name) &&
             log_bsp_text_allowed(entry.level) && std::strcmp(entry.level, kBspDefaultLevel) != 0)
             log_apply_bsp_module_level(entry.name, entry.level);
 }

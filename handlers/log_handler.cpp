@@ -41,9 +41,12 @@ json_tree log_handler_parse(const char *control)
     return request;
 }
 
-const char *log_member_text(const cJSON *object, const char *name)
+const char *log_member_text(const cJSON *object, const char *name, const char *what)
 {
-    return cJSON_GetStringValue(cJSON_GetObjectItem(object, name));
+    const char *text = cJSON_GetStringValue(cJSON_GetObjectItem(object, name));
+    if (text == nullptr)
+        LOG_NOTE("cannot find %s item\n", what);
+    return text;
 }
 
 const cJSON *log_member_object(const cJSON *object, const char *name, const char *what)

@@ -24,12 +24,9 @@ void log_handler_received(const char *name, const char *control);
 /* Parses the request; null, after a log line, when it is not JSON. */
 json_tree log_handler_parse(const char *control);
 
-/* The text of a string member, letter case of its name ignored; null when it is missing or of another type.
- * The text lives as long as the tree. */
-const char *log_member_text(const cJSON *object, const char *name);
-
-/* The object member, letter case of its name ignored; null, after the log line "cannot find WHAT item", when it is
- * missing or no object. */
+/* Members of a request, letter case of their names ignored. Null, after the log line "cannot find WHAT item", when one
+ * is missing or of another type. They live as long as the tree. */
+const char *log_member_text(const cJSON *object, const char *name, const char *what);
 const cJSON *log_member_object(const cJSON *object, const char *name, const char *what);
 
 /* Copies as much of a text as the field holds with its NUL. */

@@ -21,9 +21,8 @@ int log_msg_clean_local_log(const char *control, const unsigned char *data, std:
     const json_tree request = log_handler_parse(control);
     if (!request)
         return -1;
-    const char *value = log_member_text(request.get(), "CleanLocalLog"); /* whatever it says */
+    const char *value = log_member_text(request.get(), "CleanLocalLog", "CleanLocalLog");
     if (value == nullptr) {
-        LOG_NOTE("cannot find %s item\n", "CleanLocalLog");
         reply(kInternalError);
         return -1;
     }

@@ -41,9 +41,8 @@ int log_msg_mode_lpm_online(const char *control, const unsigned char *data, std:
     const json_tree request = log_handler_parse(control);
     if (!request)
         return -1;
-    const char *mode = log_member_text(request.get(), "mode_lpm_online");
+    const char *mode = log_member_text(request.get(), "mode_lpm_online", "mode_lpm_online");
     if (mode == nullptr) {
-        LOG_NOTE("cannot find %s item\n", "mode_lpm_online");
         reply("", kInternalError);
         return -1;
     }

@@ -23,16 +23,12 @@ bool read_request(const cJSON *tree, bsp_request *request)
     const cJSON *bsp = log_member_object(tree, "bsp", "K_bspLogSet");
     if (bsp == nullptr)
         return false;
-    request->name = log_member_text(bsp, "module_name");
+    request->name = log_member_text(bsp, "module_name", "K_bspModuleName");
     if (request->name != nullptr)
         LOG_NOTE("bsp module_name = %s\n", request->name);
-    else
-        LOG_NOTE("cannot find K_bspModuleName item\n");
-    request->level = log_member_text(bsp, "level");
+    request->level = log_member_text(bsp, "level", "K_bspModuleLevel");
     if (request->level != nullptr)
         LOG_NOTE("bsp_reqmodulelevel = %s\n", request->level);
-    else
-        LOG_NOTE("cannot find K_bspModuleLevel item\n");
     return request->name != nullptr && request->level != nullptr;
 }
 

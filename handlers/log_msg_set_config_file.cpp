@@ -83,10 +83,8 @@ const char *total_length(const cJSON *request)
     const cJSON *conf_file = log_member_object(request, "conf_file", "conf_file");
     if (conf_file == nullptr)
         return nullptr;
-    const char *total = log_member_text(conf_file, "totalLength");
-    if (total == nullptr)
-        LOG_NOTE("cannot find %s item\n", "totalLength");
-    else
+    const char *total = log_member_text(conf_file, "totalLength", "totalLength");
+    if (total != nullptr)
         LOG_NOTE("totalLength=%s\n", total);
     return total;
 }

@@ -36,7 +36,7 @@ struct stream_place {
 /* The two ends as they address each other. */
 struct stream_ends {
     int peer_class = 0; /* of the tool's address: 1 IPv4, 2 IPv6, 0 neither */
-    char client_ip[kClientIpSize] = {};
+    const char *client_ip = log_cmd_client_ip();
     char lan_ipaddr[32] = {};
     char server_ip[64] = {}; /* the device's address that the tool can reach */
 };
@@ -48,34 +48,28 @@ void reply(const stream_place &place, const char *result = kSuccess)
               place.protocol, place.port, place.ip, result);
 }
 
-/* Reads a string member into its field and logs it, or that it is missing. */
-template <std::size_t size> bool read_text(const cJSON *object, const char *name, char (&field)[size])
-{
-    const char *value = log_member_text(object, name);
-    if (value == nullptr) {
-        LOG_NOTE("cannot find K_%s item\n", name);
-        return false;
-    }
-    LOG_NOTE("%s = %s\n", name, value);
-    log_keep_text(field, value);
-    return true;
-}
-
 /* Reads the request; false, after a log line, when it is not complete. */
 bool read_request(const cJSON *tree, realtime_request *request)
 {
     const cJSON *realtime = log_member_object(tree, "realtimeLog", "K_realtimeLog");
     if (realtime == nullptr)
         return false;
-    const bool has_type = read_text(realtime, "LogType", request->log_type);
-    const bool has_action = read_text(realtime, "Action", request->action);
-    return has_type && has_action;
+    const char *log_type = log_member_text(realtime, "LogType", "K_LogType");
+    if (log_type != nullptr)
+        LOG_NOTE("LogType = %s\n", log_type);
+    const char *action = log_member_text(realtime, "Action", "K_Action");
+    if (action != nullptr)
+        LOG_NOTE("Action = %s\n", action);
+    if (log_type == nullptr || action == nullptr)
+        return false;
+    log_keep_text(request->log_type, log_type);
+    log_keep_text(request->action, action);
+    return true;
 }
 
 /* A tool on the LAN is told the LAN address, any other the WAN address of its family. */
 void find_ends(stream_ends *ends)
 {
-    log_cmd_client_ip(ends->client_ip);
     ends->peer_class = log_isValidIpOrUrl(ends->client_ip);
     vex_get_nv_item("lan_ipaddr", ends->lan_ipaddr, sizeof ends->lan_ipaddr);
     if (ends->peer_class == 2) {

@@ -40,16 +40,12 @@ bool read_request(const cJSON *request, syslog_para *para)
     const cJSON *set = log_member_object(request, "syslogParaSet", "K_syslogParaSet");
     if (set == nullptr)
         return false;
-    const char *level = log_member_text(set, "sysloglevel");
+    const char *level = log_member_text(set, "sysloglevel", "K_sysloglevel");
     if (level != nullptr)
         LOG_NOTE("sysloglevel = %s\n", level);
-    else
-        LOG_NOTE("cannot find K_sysloglevel item\n");
-    const char *size = log_member_text(set, "syslogsize");
-    if (size == nullptr) {
-        LOG_NOTE("cannot find K_syslogsize item\n");
+    const char *size = log_member_text(set, "syslogsize", "K_syslogsize");
+    if (size == nullptr)
         return false;
-    }
     LOG_NOTE("syslogsize = %s\n", size);
     return level != nullptr && take(para->level, level, "sysloglevel") && take(para->size, size, "syslogsize");
 }

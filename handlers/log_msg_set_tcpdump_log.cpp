@@ -17,26 +17,20 @@ struct capture_request {
     int snapshot_length = kSnapshotLength;
 };
 
-/* Reads a string member and logs it, or that it is missing. */
-const char *read_text(const cJSON *object, const char *name)
-{
-    const char *value = log_member_text(object, name);
-    if (value != nullptr)
-        LOG_NOTE("%s = %s\n", name, value);
-    else
-        LOG_NOTE("cannot find K_%s item\n", name);
-    return value;
-}
-
 /* Reads the request; false, after a log line, when it is not complete. */
 bool read_request(const cJSON *request, capture_request *capture)
 {
     const cJSON *tcpdump = log_member_object(request, "tcpdump", "K_tcpdump");
     if (tcpdump == nullptr)
         return false;
-    const char *interfaces = read_text(tcpdump, "InterfaceName");
-    const char *action = read_text(tcpdump, "Action");
-    if (const char *length = log_member_text(tcpdump, "TcpdumpLen"); length != nullptr) {
+    const char *interfaces = log_member_text(tcpdump, "InterfaceName", "K_InterfaceName");
+    if (interfaces != nullptr)
+        LOG_NOTE("InterfaceName = %s\n", interfaces);
+    const char *action = log_member_text(tcpdump, "Action", "K_Action");
+    if (action != nullptr)
+        LOG_NOTE("Action = %s\n", action);
+    /* The one member that may be missing without a word. */
+    if (const char *length = cJSON_GetStringValue(cJSON_GetObjectItem(tcpdump, "TcpdumpLen")); length != nullptr) {
         LOG_NOTE("TcpdumpLen = %s\n", length);
         capture->snapshot_length = log_text_to_int(length);
     }

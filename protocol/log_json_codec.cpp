@@ -4,6 +4,7 @@
 #include "core/log_tools.h"
 
 #include <algorithm>
+#include <cstring>
 #include <utility>
 
 namespace
@@ -30,6 +31,16 @@ int msgid_of(const cJSON *tree)
     return log_text_to_int(msgid->valuestring);
 }
 
+/* Parses a control text. One with an escaped NUL is not taken: a text would end there for whoever reads it, and what
+ * stands behind it would escape every check. */
+json_tree parse(const char *control)
+{
+    for (const char *at = control; (at = std::strchr(at, '\\')) != nullptr && at[1] != '\0'; at += 2)
+        if (std::strncmp(at, "\\u0000", 6) == 0)
+            return {};
+    return json_tree{cJSON_Parse(control)};
+}
+
 } // namespace
 
 int log_json_get_msgid(const char *control, json_tree &tree)
@@ -42,7 +53,7 @@ int log_json_get_msgid(const char *control, json_tree &tree)
         LOG_NOTE("%s para len error\n", __func__);
         return -1;
     }
-    tree.reset(cJSON_Parse(control));
+    tree = parse(control);
     if (!tree) {
         LOG_NOTE("cJSON_Parse error\n");
         return -1;
@@ -56,7 +67,7 @@ json_tree log_json_parse(const char *control)
 {
     if (t_dispatched.tree != nullptr && control == t_dispatched.control && *t_dispatched.tree)
         return std::move(*t_dispatched.tree);
-    return json_tree{cJSON_Parse(control)};
+    return parse(control);
 }
 
 int log_dl_msg_handle_cmd(const char *control, const unsigned char *data, std::int32_t dataLen)

@@ -30,7 +30,7 @@ extern const std::array<log_msg_handler_entry, 11> log_msg_handler_table;
  * that is JSON leaves its tree in `tree`. */
 int log_json_get_msgid(const char *control, json_tree &tree);
 
-/* Parses a control text for its handler; null when it is not JSON. A handler that dispatch runs is given the
+/* Parses a control text for its handler; null when it is not JSON, or has an escaped NUL in it. A handler that dispatch runs is given the
  * tree that dispatch has made already, by its first call for its own control text. */
 json_tree log_json_parse(const char *control);
 

@@ -4,14 +4,35 @@
 #include "core/log_line.h"
 #include "core/log_tools.h"
 
-#include <cstring>
-
 namespace
 {
 
 constexpr char kLogSource[] = "log_pkg_codec";
 
 constexpr char kName[] = "log_send_pkg_msg"; /* the routine that the log lines speak of */
+
+/* Encodes a frame in its record and sends it. The data may be in the record already. */
+int encode_and_send(int fd, SSL *ssl, const char *control, const void *data, int dataLen, log_outgoing *outgoing)
+{
+    log_msg *const msg = &outgoing->msg;
+    log_msg_clear(msg);
+    if (log_encode_fill_msg(control, data, dataLen, msg) != 0) {
+        LOG_NOTE("%s: encode log msg fail\n", kName);
+        return -1;
+    }
+    unsigned char *const frame = log_pkg_place(msg);
+    int frame_len = kPkgSendBuf;
+    if (log_encode_pkg_buf(frame, &frame_len, msg) != 0) {
+        LOG_NOTE("%s: encode pkg buf fail\n", kName);
+        return -1;
+    }
+    if (log_send_packet(fd, ssl, frame, frame_len) <= 0) {
+        LOG_NOTE("%s: send pkg fail\n", kName);
+        return -1;
+    }
+    LOG_NOTE("%s: send pkg success\n", kName);
+    return 0;
+}
 
 } // namespace
 
@@ -24,30 +45,12 @@ int log_send_pkg_msg(int fd, SSL *ssl, const char *control, const void *data, in
         LOG_NOTE("sendbuf malloc failed .\n");
         return -1;
     }
-    if (dataLen > 0 && dataLen <= static_cast<int>(kPkgDataMax))
-        std::memcpy(outgoing->msg.data, data, static_cast<std::size_t>(dataLen));
-    return log_send_pkg_piece(fd, ssl, control, outgoing.get(), dataLen);
+    return encode_and_send(fd, ssl, control, data, dataLen, outgoing.get());
 }
 
 int log_send_pkg_piece(int fd, SSL *ssl, const char *control, log_outgoing *piece, int dataLen)
 {
     if (fd < 0 || control == nullptr)
         return -1;
-    log_msg_clear(&piece->msg);
-    if (log_encode_fill_msg(control, piece->msg.data, dataLen, &piece->msg) != 0) {
-        LOG_NOTE("%s: encode log msg fail\n", kName);
-        return -1;
-    }
-    unsigned char *const frame = log_pkg_place(&piece->msg);
-    int frame_len = kPkgSendBuf;
-    if (log_encode_pkg_buf(frame, &frame_len, &piece->msg) != 0) {
-        LOG_NOTE("%s: encode pkg buf fail\n", kName);
-        return -1;
-    }
-    if (log_send_packet(fd, ssl, frame, frame_len) <= 0) {
-        LOG_NOTE("%s: send pkg fail\n", kName);
-        return -1;
-    }
-    LOG_NOTE("%s: send pkg success\n", kName);
-    return 0;
+    return encode_and_send(fd, ssl, control, piece->msg.data, dataLen, piece);
 }

@@ -4,6 +4,7 @@
 #include "core/log_registry.h"
 #include "protocol/log_json_codec.h"
 
+#include <cstddef>
 #include <cstring>
 #include <optional>
 
@@ -13,6 +14,12 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 constexpr char kName[] = "log_proc_tcp_pkg"; /* the routine that the log lines speak of */
 
+/* Bytes that are read straight into the buffer may go beyond its end for a moment. */
+unsigned char *end_of_held(log_incoming &incoming, std::size_t len)
+{
+    return reinterpret_cast<unsigned char *>(&incoming) + offsetof(log_incoming, recv_pkg_buf) + len;
+}
+
 void append(log_reassembly &state, std::span<const unsigned char> piece)
 {
     if (piece.size() >= LOG_RECV_PKG_LEN - state.recv_pkg_len) {
@@ -21,7 +28,9 @@ void append(log_reassembly &state, std::span<const unsigned char> piece)
     }
     if (piece.size() >= LOG_RECV_PKG_LEN)
         return;
-    std::memcpy(state.incoming->recv_pkg_buf + state.recv_pkg_len, piece.data(), piece.size());
+    unsigned char *const at = end_of_held(*state.incoming, state.recv_pkg_len);
+    if (at != piece.data())
+        std::memmove(at, piece.data(), piece.size());
     state.recv_pkg_len += piece.size();
 }
 
@@ -79,6 +88,11 @@ void drop_frame(log_reassembly &state, std::size_t len)
 
 } // namespace
 
+unsigned char *log_reassembly_room(log_reassembly &state)
+{
+    return state.incoming ? end_of_held(*state.incoming, state.recv_pkg_len) : nullptr;
+}
+
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece)
 {
     LOG_NOTE("enter %s len = [%d]\n", __func__, static_cast<int>(piece.size()));
@@ -100,11 +114,14 @@ int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece
         LOG_NOTE("%s:A complete packet of data received  =%d", __func__, static_cast<int>(state.recv_pkg_len));
         if (log_FindTail_pkg(held + *len - kPkgTagLen, end) == nullptr)
             return 0;
-        if (!log_cmd_stands()) {
-            LOG_NOTE("%s: another tool has taken over, command dropped\n", __func__);
-            return 0;
+        {
+            const log_cmd_turn turn;
+            if (!turn.granted()) {
+                LOG_NOTE("%s: another tool has taken over, command dropped\n", __func__);
+                return 0;
+            }
+            handle_frame(*state.incoming, *len);
         }
-        handle_frame(*state.incoming, *len);
         drop_frame(state, *len);
     }
     return 0;

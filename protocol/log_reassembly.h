@@ -16,11 +16,13 @@
 #include <span>
 
 constexpr std::size_t LOG_RECV_PKG_LEN = 61440; /* bytes; held bytes are always fewer */
+constexpr std::size_t kLogPieceMax = 2000;      /* bytes per read of a connection */
 
 /* What a frame on its way in takes up. Nothing behind the held bytes is ever read. */
 struct log_incoming {
     log_msg msg; /* the frame that is being handled */
     unsigned char recv_pkg_buf[LOG_RECV_PKG_LEN];
+    unsigned char piece[kLogPieceMax]; /* so that a piece always fits behind the held bytes */
 };
 
 /* One connection's bytes that are not yet a frame. Lives and ends with the connection; one thread feeds it. */
@@ -29,8 +31,12 @@ struct log_reassembly {
     std::size_t recv_pkg_len = 0;         /* bytes held, from offset 0 */
 };
 
+/* Where the next piece of up to kLogPieceMax bytes may be read to, so that it need not be moved: behind the held bytes.
+ * Null before the first piece. */
+unsigned char *log_reassembly_room(log_reassembly &state);
+
 /*
- * Appends a piece and handles every whole frame, in order, on the calling thread; a rest is kept for the next
+ * Appends a piece, from log_reassembly_room() or from anywhere else, and handles every whole frame, in order, on the calling thread; a rest is kept for the next
  * piece. A frame that cannot be decoded is dropped by itself. Once the thread's command connection has been
  * taken over by another tool, no further command of it runs. 0; -1 only when the buffer cannot be allocated:
  * the piece is lost. Logs at level 6 as "vex_log_manage".

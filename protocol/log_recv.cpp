@@ -16,7 +16,6 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 constexpr char kName[] = "log_recv_tcp_msg"; /* the routine that the log lines speak of */
 
-constexpr std::size_t kPieceMax = 2000;         /* bytes per read */
 constexpr useconds_t kInterruptedPause = 20000; /* microseconds */
 
 /* Serves the connection for as long as it lives, and closes it whichever way its thread ends. */
@@ -29,10 +28,10 @@ struct cmd_owner {
 };
 
 /* The blocking read, the one place where the thread can be cancelled. */
-ssize_t read_piece(int fd, std::span<unsigned char> piece)
+ssize_t read_piece(int fd, unsigned char *piece)
 {
     pthread_setcancelstate(PTHREAD_CANCEL_ENABLE, nullptr);
-    const ssize_t n = recv(fd, piece.data(), piece.size(), 0);
+    const ssize_t n = recv(fd, piece, kLogPieceMax, 0);
     pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
     return n;
 }
@@ -52,8 +51,10 @@ void log_end(int error)
 void receive(int fd)
 {
     log_reassembly state;
-    unsigned char piece[kPieceMax];
+    unsigned char first[kLogPieceMax];
     for (;;) {
+        unsigned char *const room = log_reassembly_room(state);
+        unsigned char *const piece = room != nullptr ? room : first;
         const ssize_t n = read_piece(fd, piece);
         if (n == -1 && errno == EINTR) {
             usleep(kInterruptedPause);
@@ -64,12 +65,7 @@ void receive(int fd)
             return;
         }
         LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(n));
-        {
-            const log_cmd_turn turn;
-            if (!turn.granted())
-                return;
-            log_proc_tcp_pkg(state, {piece, static_cast<std::size_t>(n)});
-        }
+        log_proc_tcp_pkg(state, {piece, static_cast<std::size_t>(n)});
         LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
     }
 }
