@@ -7,6 +7,7 @@
 
 #include <cstddef>
 #include <cstdio>
+#include <cstring>
 
 constexpr char kLogSource[] = "log_json_codec";
 
@@ -32,7 +33,9 @@ const cJSON *log_member_object(const cJSON *object, const char *name, const char
 /* Copies as much of a text as the field holds with its NUL. */
 template <std::size_t size> void log_keep_text(char (&field)[size], const char *text)
 {
-    std::snprintf(field, size, "%s", text);
+    const std::size_t len = strnlen(text, size - 1);
+    std::memcpy(field, text, len);
+    field[len] = '\0';
 }
 
 /* Sends a control text on the command connection; what becomes of it is nobody's concern. */

@@ -70,6 +70,7 @@ TEST_F(Handlers, LeaveWhatIsNoRequestUnanswered)
         cases.push_back({R"({"msgid":")" + std::string(id), kOnline, ""});
         EXPECT_NE(std::string::npos, tool_->ask(R"({"msgid":")" + std::string(id) + "\"}").find(kInternal)) << id;
     }
+    cases.push_back({R"({"msgid":"8","bsp":{"module_name":"a\u0000;b","level":"1"}})", kOnline, ""});
     check(cases);
 }
 
@@ -134,7 +135,8 @@ TEST_F(Handlers, CapturePackets)
 
 TEST_F(Handlers, KeepModuleLevels)
 {
-    std::string full = "old,1;bad one,2;x,$(reboot);info,info;";
+    const std::string longest(31, 'n');
+    std::string full = "old,1;bad one,2;x,$(reboot);" + longest + ',' + longest + "n;" + "info,info;";
     set_nv("bsplog_module_level", full);
     const std::string script = "sh /usr/vex/vex_conf/scripts/klog_mod.sh ";
     start();
@@ -149,7 +151,6 @@ TEST_F(Handlers, KeepModuleLevels)
         return result(R"({"msgid":"8","bsp":{"module_name":")" + name + R"(","level":")" + level + "\"}", said);
     };
     const std::string refused = reply("", "", "Fail:parameter error");
-    const std::string longest(31, 'n');
     check({{request("usb", ""), reply("usb", "err", "Success"), ""},
            {request("never", ""), reply("never", "info", "Success"), ""},
            {request("nolevel", ""), reply("nolevel", "info", "Success"), ""},

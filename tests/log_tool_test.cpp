@@ -46,7 +46,7 @@ TEST(LogTool, ShowsTheDeviceToPeopleAndScripts)
     EXPECT_EQ(0, status);
     EXPECT_EQ(
         "{\"msgid\":\"11\",\"mode_lpm_online\":\"\",\"Result\":\"Fail:parameter error\"}\n"
-        "vex_log_tool: the device answered \"Fail:parameter error\"\n",
+        "vex_log_tool: 127.0.0.1 port 48888 answered \"Fail:parameter error\": it does not take such a value\n",
         run_command(R"(vex_log_tool --host 127.0.0.1 --json raw '{"msgid":"11","mode_lpm_online":"up"}')", &status));
     EXPECT_EQ(1, status);
 }
@@ -62,8 +62,8 @@ TEST(LogTool, DoesEverythingOnARealDevice)
         EXPECT_NE(std::string::npos, out.find(words)) << command << '\n' << out;
     };
     says("syslog", "System log: level 7, size 512 KB, at most 20480 KB\n");
-    says("syslog 5 64", "System log: level 5, size 64 KB from now on\n");
-    says("bsp usb err", "Kernel module usb: log level err from now on\n");
+    says("syslog 5 64", "System log: level 5, size 64 KB: the device was told so\n");
+    says("bsp usb err", "Kernel module usb: log level err: the device was told so\n");
     says("bsp usb", "Kernel module usb: log level err\n");
     says("modem", "The modem is set to: online\n");
     says("capture start lan,lo --len 100", "told to capture on lan,lo.");
@@ -72,7 +72,7 @@ TEST(LogTool, DoesEverythingOnARealDevice)
     run_command("until [ -e /logfs/lo.pcap ] && [ -e /logfs/bridge0.pcap ]; do sleep 0.01; done");
     says("version", "VX-520");
     run_command("until [ $(stat -c %s /logfs/lo.pcap) -gt 24 ]; do killall -USR2 tcpdump; sleep 0.01; done");
-    says("capture stop", "stopped");
+    says("capture stop", "told to stop");
     run_command("while pidof tcpdump; do sleep 0.01; done; head -c 1500000 /dev/urandom >/logfs/noise");
     says("archive /tmp/a.tgz", "bytes\n  capture logfs/");
     EXPECT_EQ("", run_command("killall syslogd; mkdir /tmp/x && tar -xzf /tmp/a.tgz -C /tmp/x && rm /logfs/syslog "
@@ -129,16 +129,19 @@ TEST(LogTool, StoresNothingButWholeArchives)
         int status;
         const char *words;
     } cases[] = {
-        {piece(size, good.substr(0, 50)) + piece(size, good.substr(50)), 0, "/tmp/d/a: 1 files\n"},
-        {not_packed + piece(size, good), 0, "could not pack its logs. Most likely one of them changed"},
-        {not_packed + not_packed, 1, "vex_log_tool: the device could not pack its logs."},
-        {frame(R"({"msgid":"2","Result":"Fail:Open log file error"})"), 1, "answered \"Fail:Open log file error\""},
+        {piece(size, good.substr(0, 50)) + piece(size, good.substr(50)), 0, "/tmp/d/a: 1 file\n"},
+        {not_packed + piece(size, good), 0, "most likely a log changed while the logs were packed"},
+        {not_packed + not_packed, 1, "answered \"Fail:Compressed logfs error\": most likely a log"},
+        {frame(R"({"msgid":"2","Result":"Fail:Open log file error"})"), 1, "lost its archive. Try again"},
+        {piece("99999999999", "x"), 1, "do not fit together"},
+        {piece(size, good.substr(0, good.size() - 8) + std::string(4, 'c') + good.substr(good.size() - 4)), 1,
+         "no whole gzip tar: incorrect data check"},
         {piece(size, good.substr(0, 50)) + piece("9999", good.substr(50)), 1, "do not fit together"},
         {piece("60", good), 1, "do not fit together"},
         {piece("0", ""), 1, "do not fit together"},
         {piece(size, good.substr(0, 50)), 2, "ended before the answer was there"},
-        {piece("9", "no gzip!!"), 1, "is no readable gzip tar: Unrecognized archive format"},
-        {piece("90", good.substr(0, 90)), 1, "is no readable gzip tar: truncated gzip input"},
+        {piece("9", "no gzip!!"), 1, "is no whole gzip tar: it is not packed with gzip"},
+        {piece("90", good.substr(0, 90)), 1, "is no whole gzip tar: unexpected end of file"},
     };
     for (const auto &c : cases) {
         const fake_device device(c.says, false);
@@ -165,15 +168,17 @@ TEST(LogTool, SaysWhatWentWrongAndWhere)
         const char *words; /* %: the device's address and port */
     } cases[] = {
         {whole, 0, "Device at %"},
-        {frame(R"({"msgid":"3","Result":"Fail:x"})"), 1, "the device answered \"Fail:x\""},
-        {frame(""), 1, "the device refused the request"},
-        {frame("no JSON"), 1, "the device's reply has no result"},
+        {frame(R"({"msgid":"3","Result":"Fail:x"})"), 1, "% answered \"Fail:x\""},
+        {frame(""), 1, "% refused the request"},
+        {frame("no JSON"), 1, "% sent a reply without a result: no JSON"},
+        {frame(R"({"msgid":"4","Result":"Success"})"), 1, "% sent the reply to another command"},
+        {"220 ready", 2, "what % sent is not a frame"},
         {"", 2, "the connection to % ended before the answer was there"},
         {whole.substr(0, 20), 2, "another one may have taken it over"},
         {"HTTP/1.1 400 Bad Request\r\n\r\n", 2, "what % sent is not a frame"},
         {"#~" + big_endian(2049) + std::string(3000, 'c'), 2, "is not a frame"},
         {whole.substr(0, whole.size() - 1) + "!", 2, "is not a frame"},
-        {frame(R"({"Result":"\u001b[2J"})"), 1, "answered \"\\x1b[2J\""},
+        {frame(R"({"msgid":"3","Result":"\u001b[2J\u009b"})"), 1, "answered \"\\x1b[2J\xc2\\x9b\""},
     };
     for (const auto &c : cases) {
         const fake_device device(c.says, false);

@@ -1,33 +1,76 @@
 #include "tools/tool_answer.h"
 
+#include <utility>
+
+namespace
+{
+
+/* What to do about an answer that is no success. */
+const char *advice(const std::string &result)
+{
+    constexpr std::pair<const char *, const char *> kAdvice[] = {
+        {"Fail:Modem file is not exisit", ": push a configuration package with a Diag.cfg first (config)"},
+        {"Fail:Compressed logfs error",
+         ": most likely a log changed while the logs were packed. Try again, or stop captures "
+         "and streams first"},
+        {"Fail:Open log file error", ": it has lost its archive. Try again"},
+        {"Fail:parameter error", ": it does not take such a value"},
+        {"Fail:Device internal error",
+         ": it could not do it, or misses something in the command. Its own log tells more"},
+    };
+    for (const auto &[failure, text] : kAdvice)
+        if (result == failure)
+            return text;
+    return ". Its own log may tell more";
+}
+
+/* The text of a member; empty when there is none. */
+std::string member(const cJSON *root, const char *name)
+{
+    const char *text = cJSON_GetStringValue(cJSON_GetObjectItem(root, name));
+    return text != nullptr ? text : "";
+}
+
+} // namespace
+
 std::string tool_printable(const std::string &text)
 {
     constexpr char kHex[] = "0123456789abcdef";
     std::string out;
+    unsigned char last = 0;
     for (const char c : text) {
         const auto byte = static_cast<unsigned char>(c);
-        if (byte >= 0x20 && byte != 0x7f)
-            out += c;
-        else
+        const bool second_control = last == 0xc2 && byte < 0xa0; /* U+0080 to U+009F in UTF-8 */
+        if (byte < 0x20 || byte == 0x7f || second_control)
             out.append("\\x").append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
+        else
+            out += c;
+        last = byte;
     }
     return out;
 }
 
-tool_answer tool_read_answer(const std::string &control)
+std::string tool_msgid(const std::string &control)
+{
+    const json_tree root{cJSON_ParseWithLength(control.data(), control.size())};
+    return member(root.get(), "msgid");
+}
+
+tool_answer tool_read_answer(const std::string &control, const std::string &msgid)
 {
     if (control.empty())
-        return {tool_verdict::refused, "the device refused the request: it does not know such a command", nullptr,
-                control};
+        return {tool_verdict::refused, "refused the request: it does not know such a command or value", nullptr, ""};
     json_tree root{cJSON_ParseWithLength(control.data(), control.size())};
-    const char *result = cJSON_GetStringValue(cJSON_GetObjectItem(root.get(), "Result"));
-    if (result == nullptr)
-        return {tool_verdict::garbled, "the device's reply has no result: " + tool_printable(control), std::move(root),
+    const std::string result = member(root.get(), "Result");
+    if (result.empty())
+        return {tool_verdict::garbled, "sent a reply without a result: " + tool_printable(control), nullptr, control};
+    if (member(root.get(), "msgid") != msgid)
+        return {tool_verdict::garbled, "sent the reply to another command: " + tool_printable(control), nullptr,
                 control};
-    const std::string said = result;
-    if (said == "Success")
+    if (result == "Success")
         return {tool_verdict::success, "", std::move(root), control};
-    return {tool_verdict::failed, "the device answered \"" + tool_printable(said) + '"', std::move(root), control};
+    const std::string reason = "answered \"" + tool_printable(result) + '"' + advice(result);
+    return {tool_verdict::failed, reason, std::move(root), control};
 }
 
 std::string tool_answer_text(const tool_answer &answer, const char *group, const char *name)

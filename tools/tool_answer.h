@@ -23,8 +23,11 @@ struct tool_answer {
 /* The text as a terminal may show it: control bytes, which could command the terminal, as \xNN. */
 std::string tool_printable(const std::string &text);
 
-/* Judges the control text of a reply. */
-tool_answer tool_read_answer(const std::string &control);
+/* The message id of a command or a reply; empty when it has none. */
+std::string tool_msgid(const std::string &control);
+
+/* Judges the control text of a reply to the command of that message id. */
+tool_answer tool_read_answer(const std::string &control, const std::string &msgid);
 
 /* The printable text of the reply's member `name` inside its member `group`, or of its own where that is null; empty
  * when there is none. */

@@ -44,7 +44,7 @@ int tool_syslog(tool_device &device, const std::string &level, const std::string
     if (level.empty())
         std::printf(", at most %s KB\n", value("syslogsizeMax").c_str());
     else
-        std::printf(" from now on\n");
+        std::printf(": the device was told so\n");
     return kDone;
 }
 
@@ -67,7 +67,7 @@ int tool_capture_stop(tool_device &device)
     int status = kDone;
     const std::string command = tool_command("5", "tcpdump", {{"InterfaceName", ""}, {"Action", "end"}});
     if (tool_ask(device, command, status))
-        std::printf("All captures are stopped; their files are in the log archive.\n");
+        std::printf("The device was told to stop all captures; their files are in the log archive.\n");
     return status;
 }
 
@@ -85,7 +85,7 @@ int tool_bsp(tool_device &device, const std::string &module, const std::string &
     if (const auto answer =
             tool_ask(device, tool_command("8", "bsp", {{"module_name", module}, {"level", level}}), status))
         std::printf("Kernel module %s: log level %s%s\n", tool_answer_text(*answer, "bsp", "module_name").c_str(),
-                    tool_answer_text(*answer, "bsp", "level").c_str(), level.empty() ? "" : " from now on");
+                    tool_answer_text(*answer, "bsp", "level").c_str(), level.empty() ? "" : ": the device was told so");
     return status;
 }
 

@@ -1,7 +1,9 @@
 #include "tools/tool_config.h"
 
 #include "tools/tool_progress.h"
+#include "tools/tool_tar.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdio>
@@ -19,17 +21,29 @@ constexpr char kLeftover[] =
     ". What it has received of the package stays in front of the next one: before the next try, "
     "delete it with the command clean, which deletes the logs too";
 
-/* Sends a frame of the package and waits until the device has taken it; false, and why, when it has not. */
-bool push(tool_device &device, std::uint64_t total, std::span<const unsigned char> data, int &status, std::string &why)
+/* How a push is going. */
+struct push_state {
+    int status = kDone;
+    std::string why;     /* after a failure */
+    std::string control; /* the device's last reply as it came */
+    bool begun = false;  /* whether the device may have data of this package */
+};
+
+/* Sends a frame of the package and waits until the device has taken it; false when it has not. */
+bool push(tool_device &device, std::uint64_t total, std::span<const unsigned char> data, push_state &state)
 {
     const std::string command = tool_command("1", "conf_file", {{"totalLength", std::to_string(total)}});
-    const std::optional<tool_answer> answer = tool_exchange(device, command, data, why);
-    status = answer ? kDeviceSaidNo : kNoAnswer;
-    if (answer)
-        why = answer->reason;
-    if (answer && answer->verdict == tool_verdict::success)
-        status = kDone;
-    return status == kDone;
+    const std::optional<tool_answer> answer = tool_exchange(device, command, data, state.why);
+    if (!answer) {
+        state.status = kNoAnswer;
+        return false;
+    }
+    state.control = answer->control;
+    if (answer->verdict == tool_verdict::success)
+        return true;
+    state.status = kDeviceSaidNo;
+    state.why = tool_said(device, *answer);
+    return false;
 }
 
 /* Reads a piece whole, unless the file ends. */
@@ -45,19 +59,22 @@ std::span<const unsigned char> read_piece(int fd, std::span<unsigned char> buffe
     return buffer.first(len);
 }
 
-/* Sends the package's pieces. */
-bool push_pieces(tool_device &device, int fd, std::uint64_t total, int &status, std::string &why)
+/* Sends the package's pieces; false when one could not be read or sent. */
+bool push_pieces(tool_device &device, int fd, std::uint64_t total, push_state &state)
 {
     tool_progress progress("sent", total);
     unsigned char buffer[kPieceSize];
     for (std::uint64_t left = total; left > 0;) {
+        errno = 0;
         const auto piece = read_piece(fd, std::span(buffer).first(std::min<std::uint64_t>(left, kPieceSize)));
         if (piece.empty()) {
-            status = kNoAnswer;
-            why = "the file became shorter while it was sent";
+            state.status = kNoAnswer;
+            state.why =
+                std::string("cannot read the package: ") + (errno != 0 ? std::strerror(errno) : "it became shorter");
             return false;
         }
-        if (!push(device, total, piece, status, why))
+        state.begun = true;
+        if (!push(device, total, piece, state))
             return false;
         left -= piece.size();
         progress.advance(piece.size());
@@ -65,28 +82,47 @@ bool push_pieces(tool_device &device, int fd, std::uint64_t total, int &status, 
     return true;
 }
 
+/* Opens a package; none, and why, when it is no readable tar. */
+unique_fd open_package(const std::string &file, std::uint64_t &total, std::string &why)
+{
+    unique_fd in{open(file.c_str(), O_RDONLY | O_CLOEXEC)};
+    struct stat about {
+    };
+    std::string contents;
+    if (!in || fstat(in.get(), &about) != 0) {
+        why = "cannot read " + file + ": " + std::strerror(errno);
+    } else if (!S_ISREG(about.st_mode) || about.st_size > INT_MAX) {
+        why = file + " is no package: that is a tar file of up to 2 GB";
+    } else if (!tool_check_tar(in.get(), tool_packing::plain, contents, why)) {
+        why = file + " is no package, which is a plain tar file: " + why;
+    } else {
+        lseek(in.get(), 0, SEEK_SET);
+        total = static_cast<std::uint64_t>(about.st_size);
+        return in;
+    }
+    return {};
+}
+
 } // namespace
 
 int tool_config(tool_device &device, const std::string &file)
 {
-    const unique_fd in{open(file.c_str(), O_RDONLY | O_CLOEXEC)};
-    struct stat about {
-    };
-    if (!in || fstat(in.get(), &about) != 0)
-        return tool_fail(kNoAnswer, "cannot read " + file + ": " + std::strerror(errno));
-    if (!S_ISREG(about.st_mode) || about.st_size == 0 || about.st_size > INT_MAX)
-        return tool_fail(kNoAnswer, file + " is no package: it is to be a tar file of up to 2 GB");
-    const auto total = static_cast<std::uint64_t>(about.st_size);
+    push_state state;
+    std::uint64_t total = 0;
+    const unique_fd in = open_package(file, total, state.why);
+    if (!in || !tool_reach(device, state.why))
+        return tool_fail(kNoAnswer, state.why);
     tool_catch_interrupts();
-    int status = kDone;
-    std::string why;
-    if (!push(device, 0, {}, status, why)) /* forgets what another tool may have left half done */
-        return tool_fail(status, why);
-    if (!push_pieces(device, in.get(), total, status, why))
-        return tool_fail(status, why + kLeftover);
-    std::printf(device.json ? "{\"sent\":%llu,\"Result\":\"Success\"}\n"
-                            : "The device has taken the package of %llu bytes. It unpacks it and starts its set-up "
-                              "script; what comes of\nthat is in the device's own log only.\n",
-                static_cast<unsigned long long>(total));
+    /* The first frame has the device forget the count of a package that was broken off. */
+    const bool done = push(device, 0, {}, state) && push_pieces(device, in.get(), total, state);
+    if (device.json && !state.control.empty())
+        std::printf("%s\n", state.control.c_str());
+    if (!done)
+        return tool_fail(state.status, state.why + (state.begun ? kLeftover : ""));
+    if (!device.json)
+        std::printf(
+            "The device has taken the package of %llu bytes. It unpacks it and starts its set-up script; what comes "
+            "of\nthat is in the device's own log only.\n",
+            static_cast<unsigned long long>(total));
     return kDone;
 }

@@ -1,5 +1,7 @@
 #include "tools/tool_device.h"
 
+#include "tools/tool_wait.h"
+
 #include <cstdio>
 
 int tool_fail(int status, const std::string &why)
@@ -12,7 +14,9 @@ int tool_fail(int status, const std::string &why)
 bool tool_reach(tool_device &device, std::string &why)
 {
     if (!device.link)
-        device.link = tool_connect(device.host, device.port, device.limits, why);
+        device.link =
+            tool_connect(device.host, device.port, device.limits,
+                         ". Check the address, and that the device is on and its log daemon runs in server mode", why);
     return device.link.has_value();
 }
 
@@ -33,12 +37,26 @@ std::string tool_command(const char *msgid, const char *group,
 std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
                                          std::span<const unsigned char> data, std::string &why)
 {
-    if (!tool_reach(device, why) || !tool_send(*device.link, command, data, why))
+    if (command.size() > kPkgControlMax) {
+        why = "the command has " + std::to_string(command.size()) + " characters; " + std::to_string(kPkgControlMax) +
+              " is the most";
         return std::nullopt;
-    const std::optional<tool_frame> frame = tool_receive(*device.link, why);
-    if (!frame)
+    }
+    if (!tool_reach(device, why))
         return std::nullopt;
-    return tool_read_answer(frame->control);
+    std::optional<tool_frame> frame;
+    if (tool_send(*device.link, command, data, why))
+        frame = tool_receive(*device.link, device.limits.reply, why);
+    if (frame)
+        return tool_read_answer(frame->control, tool_msgid(command));
+    if (!tool_interrupted())
+        device.link.reset();
+    return std::nullopt;
+}
+
+std::string tool_said(const tool_device &device, const tool_answer &answer)
+{
+    return device.host + " port " + device.port + ' ' + answer.reason;
 }
 
 std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status)
@@ -49,11 +67,11 @@ std::optional<tool_answer> tool_ask(tool_device &device, const std::string &comm
         status = tool_fail(kNoAnswer, why);
         return std::nullopt;
     }
-    if (device.json && !answer->control.empty())
+    if (device.json && answer->root)
         std::printf("%s\n", answer->control.c_str());
     status = kDone;
     if (answer->verdict != tool_verdict::success)
-        status = tool_fail(kDeviceSaidNo, answer->reason);
+        status = tool_fail(kDeviceSaidNo, tool_said(device, *answer));
     if (status != kDone || device.json)
         answer.reset();
     return answer;

@@ -22,7 +22,7 @@ struct tool_device {
     std::string port = "48888";
     tool_limits limits;
     bool json = false;             /* print replies as they came instead of words */
-    std::optional<tool_link> link; /* once it was reached */
+    std::optional<tool_link> link; /* once it was reached, until it fails */
 };
 
 /* Says what failed; the status. */
@@ -36,7 +36,11 @@ bool tool_reach(tool_device &device, std::string &why);
 std::string tool_command(const char *msgid, const char *group,
                          std::initializer_list<std::pair<const char *, std::string>> members);
 
-/* Sends a command and waits for its answer. Nothing, and `why`, when there was none. */
+/* Where the device is and what its answer says, as a sentence. */
+std::string tool_said(const tool_device &device, const tool_answer &answer);
+
+/* Sends a command and waits for its answer. Nothing, and `why`, when there was none; then the link is given up, unless it
+ * was the user who did not want to wait. */
 std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
                                          std::span<const unsigned char> data, std::string &why);
 

@@ -1,7 +1,9 @@
 #include "tools/tool_link.h"
 
+#include "tools/tool_log.h"
 #include "tools/tool_wait.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -18,6 +20,8 @@ struct address_list_deleter {
     void operator()(addrinfo *list) const { freeaddrinfo(list); }
 };
 
+constexpr char kInterrupted[] = "interrupted";
+
 using address_list = std::unique_ptr<addrinfo, address_list_deleter>;
 
 /* Waits until the socket is ready for `events`; false, and `why` where it is not the time, when it is not. */
@@ -26,7 +30,7 @@ bool wait_ready(int fd, short events, tool_clock::time_point end, std::string &w
     pollfd entry{fd, events, 0};
     const tool_wait event = tool_wait_for({&entry, 1}, end);
     if (event == tool_wait::interrupted)
-        why = "interrupted";
+        why = kInterrupted;
     return event == tool_wait::ready;
 }
 
@@ -57,20 +61,22 @@ std::string ended(const tool_link &link, const std::string &how)
            "look at the device's own log";
 }
 
-/* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are
- * none. */
+/* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are none. */
 std::optional<std::size_t> frame_length(const std::vector<unsigned char> &held)
 {
+    if (!std::equal(held.begin(), held.begin() + static_cast<std::ptrdiff_t>(std::min(held.size(), kPkgTagLen)),
+                    PKG_HEAD))
+        return std::nullopt;
     if (held.size() < kPkgMin)
         return 0;
     const std::uint32_t control_len = log_pkg_get_u32(held.data() + kPkgControlLenAt);
-    if (std::memcmp(held.data(), PKG_HEAD, kPkgTagLen) != 0 || control_len > kPkgControlMax)
+    if (control_len > kPkgControlMax)
         return std::nullopt;
     const std::size_t data_len_at = kPkgControlAt + control_len;
     if (held.size() < data_len_at + 4)
         return 0;
     const std::uint32_t data_len = log_pkg_get_u32(held.data() + data_len_at);
-    if (data_len > kPkgDataMax)
+    if (data_len >= kPkgDataMax)
         return std::nullopt;
     return kPkgMin + control_len + data_len;
 }
@@ -87,34 +93,39 @@ std::optional<tool_frame> take_frame(tool_link &link, std::size_t len)
                       {msg->data, static_cast<std::size_t>(msg->dataLen)}};
 }
 
-/* Waits for more bytes and holds them. */
-bool receive_some(tool_link &link, std::string &why)
+/* Waits for more bytes and holds them; false, and why, when none come. */
+bool receive_some(tool_link &link, std::chrono::milliseconds first, std::string &why)
 {
-    const auto limit = link.held.empty() ? link.limits.reply : link.limits.stall;
-    if (!wait_ready(link.fd.get(), POLLIN, tool_clock::now() + limit, why)) {
-        if (why.empty())
-            why = link.where + " sent nothing for " + tool_seconds(limit) +
-                  (link.held.empty()
-                       ? ". Either it is still at work, then try again with a larger --reply-timeout, or it does "
-                         "not know the command: such a one it leaves unanswered"
-                       : " in the middle of an answer. Try again with a larger --stall-timeout");
+    const bool answer = link.held.empty() && first == link.limits.reply;
+    const auto limit = link.held.empty() ? first : link.limits.stall;
+    std::string interrupt;
+    if (!wait_ready(link.fd.get(), POLLIN, tool_clock::now() + limit, interrupt)) {
+        why = !interrupt.empty()
+                  ? interrupt
+                  : link.where + " sent nothing for " + tool_seconds(limit) +
+                        (answer ? ". Either it is still at work, then try again with a larger "
+                                  "--reply-timeout, or it does not know the command: such a one it leaves "
+                                  "unanswered"
+                                : " in the middle of an answer. Try again, or with a larger "
+                                  "--stall-timeout");
         return false;
     }
     unsigned char piece[65536];
     const ssize_t n = recv(link.fd.get(), piece, sizeof piece, 0);
-    if (n > 0)
+    if (n > 0) {
         link.held.insert(link.held.end(), piece, piece + n);
-    else if (n == 0)
-        why = ended(link, "the device closed it");
-    else if (errno != EAGAIN && errno != EINTR)
-        why = ended(link, std::strerror(errno));
-    return why.empty();
+        return true;
+    }
+    if (n < 0 && (errno == EAGAIN || errno == EINTR))
+        return true;
+    why = ended(link, n == 0 ? "the device closed it" : std::strerror(errno));
+    return false;
 }
 
 } // namespace
 
 std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
-                                      std::string &why)
+                                      const char *advice, std::string &why)
 {
     const std::string where = host + " port " + port;
     addrinfo hints{};
@@ -125,31 +136,35 @@ std::optional<tool_link> tool_connect(const std::string &host, const std::string
         return std::nullopt;
     }
     const address_list addresses{found};
+    long left = 0; /* addresses to try: each gets its share of the time that is left */
+    for (const addrinfo *at = addresses.get(); at != nullptr; at = at->ai_next)
+        ++left;
     const auto end = tool_clock::now() + limits.connect;
-    std::string error = "no answer within " + tool_seconds(limits.connect);
-    for (const addrinfo *at = addresses.get(); at != nullptr; at = at->ai_next) {
-        unique_fd sock = connect_one(*at, end, error);
+    std::string error;
+    for (const addrinfo *at = addresses.get(); at != nullptr; at = at->ai_next, --left) {
+        error = "no answer within " + tool_seconds(limits.connect);
+        unique_fd sock = connect_one(*at, tool_clock::now() + (end - tool_clock::now()) / left, error);
         if (!sock)
             continue;
         const int on = 1;
         setsockopt(sock.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
+        setsockopt(sock.get(), SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
         return tool_link{.fd = std::move(sock), .where = where, .limits = limits, .held = {}};
     }
-    why = "cannot connect to " + where + ": " + error +
-          ". Check the address, and that the device is on and its log daemon runs in server mode";
+    why = error == kInterrupted ? error : "cannot connect to " + where + ": " + error + advice;
     return std::nullopt;
 }
 
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why)
 {
+    tool_log_frame("sent", control, data.size());
     std::vector<unsigned char> frame(kPkgSendBuf);
     auto len = static_cast<std::int32_t>(frame.size());
     const void *const bytes = data.empty() ? "" : static_cast<const void *>(data.data());
     log_msg_clear(link.msg.get());
     if (log_encode_fill_msg(control.c_str(), bytes, static_cast<std::int32_t>(data.size()), link.msg.get()) != 0 ||
         log_encode_pkg_buf(frame.data(), &len, link.msg.get()) != 0) {
-        why = "the command has " + std::to_string(control.size()) + " characters; " + std::to_string(kPkgControlMax) +
-              " is the most";
+        why = "the command is too long for a frame";
         return false;
     }
     for (std::size_t sent = 0; sent < static_cast<std::size_t>(len);) {
@@ -169,18 +184,20 @@ bool tool_send(tool_link &link, const std::string &control, std::span<const unsi
     return true;
 }
 
-std::optional<tool_frame> tool_receive(tool_link &link, std::string &why)
+std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why)
 {
     for (;;) {
         const std::optional<std::size_t> len = frame_length(link.held);
         if (len && (*len == 0 || link.held.size() < *len)) {
-            if (!receive_some(link, why))
+            if (!receive_some(link, first, why))
                 return std::nullopt;
             continue;
         }
         std::optional<tool_frame> frame = len ? take_frame(link, *len) : std::nullopt;
         if (!frame)
             why = "what " + link.where + " sent is not a frame. Is it a device's log daemon that listens there?";
+        else
+            tool_log_frame("received", frame->control, frame->data.size());
         return frame;
     }
 }

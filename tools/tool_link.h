@@ -36,14 +36,15 @@ struct tool_frame {
     std::span<const unsigned char> data; /* the link's, until it is used again */
 };
 
-/* Connects to the first address of `host` that accepts. */
+/* Connects to the first address of `host` that accepts. `advice` ends the sentence when none does. */
 std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
-                                      std::string &why);
+                                      const char *advice, std::string &why);
 
 /* Sends one frame. */
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why);
 
-/* Waits for the next frame. */
-std::optional<tool_frame> tool_receive(tool_link &link, std::string &why);
+/* Waits for the next frame, `first` for its first byte: link.limits.reply for an answer, link.limits.stall inside a
+ * transfer. */
+std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why);
 
 #endif

@@ -1,6 +1,7 @@
 #include "tools/tool_log.h"
 
 #include "platform/vex_platform.h"
+#include "tools/tool_answer.h"
 
 #include <cstdarg>
 #include <cstdio>
@@ -17,6 +18,12 @@ void tool_log_show()
     g_shown = true;
 }
 
+void tool_log_frame(const char *what, const std::string &control, std::size_t data_len)
+{
+    if (g_shown)
+        std::fprintf(stderr, "%s %s and %zu bytes of data\n", what, tool_printable(control).c_str(), data_len);
+}
+
 void vex_syslog_append(int level, const char *source, int line, int /*module*/, const char *format, ...)
 {
     if (!g_shown)
@@ -26,5 +33,8 @@ void vex_syslog_append(int level, const char *source, int line, int /*module*/, 
     va_start(args, format);
     std::vsnprintf(text, sizeof text, format, args);
     va_end(args);
-    std::fprintf(stderr, "%d %s:%d %s\n", level, source, line, text);
+    std::string shown = text;
+    if (shown.ends_with('\n'))
+        shown.pop_back();
+    std::fprintf(stderr, "%d %s:%d %s\n", level, source, line, tool_printable(shown).c_str());
 }

@@ -60,9 +60,10 @@ void tool_progress::draw_bar() const
 {
     const double share = static_cast<double>(done_) / static_cast<double>(total_);
     const double rate = static_cast<double>(done_) / seconds_since(start_);
-    const int left = rate > 0 ? static_cast<int>(static_cast<double>(total_ - std::min(done_, total_)) / rate) : 0;
+    const double seconds = static_cast<double>(total_ - std::min(done_, total_)) / std::max(rate, 1.0);
+    const int left = static_cast<int>(std::min(seconds, 5999.0));
     const int filled = std::min(static_cast<int>(share * kBarWidth), kBarWidth);
-    std::fprintf(stderr, "\r[%.*s%*s] %3.0f%%  %s  %s/s  %d:%02d left ", filled, "##############################",
+    std::fprintf(stderr, "\r[%.*s%*s] %3.0f%%  %s  %s/s  %d:%02d left\033[K", filled, "##############################",
                  kBarWidth - filled, "", share * 100, tool_bytes(done_).c_str(),
                  tool_bytes(static_cast<std::uint64_t>(rate)).c_str(), left / 60, left % 60);
 }

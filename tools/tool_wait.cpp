@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <climits>
 #include <csignal>
+#include <initializer_list>
 #include <sys/signalfd.h>
 #include <vector>
 
@@ -14,32 +15,41 @@ namespace
 
 unique_fd g_interrupts; /* readable, and never read, once a signal has come */
 
-sigset_t interrupt_signals()
+/* Blocks the signals and makes them readable. */
+void listen_for(std::initializer_list<int> signals)
 {
     sigset_t set;
     sigemptyset(&set);
-    for (const int signal : {SIGINT, SIGTERM, SIGHUP})
+    for (const int signal : signals)
         sigaddset(&set, signal);
-    return set;
+    sigprocmask(SIG_BLOCK, &set, nullptr);
+    g_interrupts.reset(signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK));
 }
 
 } // namespace
 
 void tool_catch_interrupts()
 {
-    const sigset_t set = interrupt_signals();
-    sigprocmask(SIG_BLOCK, &set, nullptr);
-    g_interrupts.reset(signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK));
+    struct sigaction hangup {
+    };
+    sigaction(SIGHUP, nullptr, &hangup);
+    if (hangup.sa_handler == SIG_IGN)
+        listen_for({SIGINT, SIGTERM});
+    else
+        listen_for({SIGINT, SIGTERM, SIGHUP});
 }
 
-void tool_release_interrupts()
+void tool_forget_interrupts()
 {
-    const sigset_t set = interrupt_signals();
     signalfd_siginfo taken;
     while (read(g_interrupts.get(), &taken, sizeof taken) > 0)
         continue;
-    g_interrupts.reset();
-    sigprocmask(SIG_UNBLOCK, &set, nullptr);
+    listen_for({SIGINT, SIGTERM});
+}
+
+bool tool_interrupted()
+{
+    return tool_wait_for({}, tool_clock::now()) == tool_wait::interrupted;
 }
 
 tool_wait tool_wait_for(std::span<pollfd> sockets, tool_clock::time_point end)

@@ -15,13 +15,18 @@ enum class tool_wait {
     interrupted, /* the user wants to end, and from now on every wait says so */
 };
 
-/* From now on SIGINT, SIGTERM and SIGHUP no longer kill the tool but end its waits, so that it can tidy up. */
+/* From now on SIGINT, SIGTERM and SIGHUP (unless it is ignored) no longer kill the tool but end its waits, so that it can
+ * tidy up. */
 void tool_catch_interrupts();
 
-/* Takes back that the user wanted to end, for the last words to the device; the next signal kills again. */
-void tool_release_interrupts();
+/* Takes back that the user wanted to end, for the last words to the device: only Ctrl-C or SIGTERM, given again, end
+ * waits now. */
+void tool_forget_interrupts();
 
 tool_wait tool_wait_for(std::span<pollfd> sockets, tool_clock::time_point end);
+
+/* Whether the user wants to end, for work that waits for nothing. */
+bool tool_interrupted();
 
 /* A limit as text, such as "0.200 s". */
 std::string tool_seconds(std::chrono::milliseconds limit);

@@ -3,9 +3,12 @@
 #include "tools/tool_commands.h"
 #include "tools/tool_config.h"
 #include "tools/tool_log.h"
+#include "tools/tool_process.h"
 #include "tools/tool_stream.h"
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
+#include <cstdlib>
 #include <functional>
 
 namespace
@@ -14,21 +17,30 @@ namespace
 /* What is asked of the device; the exit status. */
 using tool_job = std::function<int(tool_device &)>;
 
+const CLI::Validator kDigits(
+    [](const std::string &text) {
+        return !text.empty() && text.find_first_not_of("0123456789") == std::string::npos ? "" : "a number is wanted";
+    },
+    "");
+
 /* An option that takes a limit in seconds. */
 void add_limit(CLI::App &app, const char *name, std::chrono::milliseconds &limit, const char *help)
 {
     constexpr double kMost = 86400;
     app.add_option_function<double>(
            name, [&limit](double s) { limit = std::chrono::milliseconds(static_cast<long>(s * 1000)); }, help)
-        ->check(CLI::Range(0.001, kMost))
+        ->check([](const std::string &text) {
+            const double s = std::strtod(text.c_str(), nullptr);
+            return s >= 0.001 && s <= kMost ? "" : "a time is 0.001 to 86400 seconds"; /* and never "nan" */
+        })
         ->type_name("SECONDS")
-        ->default_str(std::to_string(limit.count() / 1000));
+        ->default_str(limit.count() > 0 ? std::to_string(limit.count() / 1000) : "");
 }
 
 void add_common_options(CLI::App &app, tool_device &device)
 {
     app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
-    app.add_option("--port", device.port, "port of its log daemon")->capture_default_str();
+    app.add_option("--port", device.port, "port of its log daemon")->check(CLI::Range(1, 65535))->capture_default_str();
     app.add_flag("--json", device.json, "print the device's reply as it came");
     app.add_flag_callback("--debug", tool_log_show, "show on standard error what goes over the wire");
     add_limit(app, "--connect-timeout", device.limits.connect, "longest wait for a connection");
@@ -49,8 +61,12 @@ void add_capture(CLI::App &app, tool_words &words, tool_job &job)
     CLI::App *capture = app.add_subcommand("capture", "capture packets into the device's logs");
     capture->require_subcommand(1);
     CLI::App *start = capture->add_subcommand("start", "start anew, on up to four interfaces");
-    start->add_option("INTERFACES", words.first, "such as eth0,wan,lan; wan and lan are the device's own")->required();
-    start->add_option("--len", words.second, "bytes to keep of each packet")->check(CLI::NonNegativeNumber);
+    start->add_option("INTERFACES", words.first, "such as eth0,wan,lan; wan and lan are the device's own")
+        ->required()
+        ->check([](const std::string &list) {
+            return std::count(list.begin(), list.end(), ',') < 4 ? "" : "a device captures on four interfaces at most";
+        });
+    start->add_option("--len", words.second, "bytes to keep of each packet")->check(kDigits);
     start->callback(
         [&] { job = [&](tool_device &device) { return tool_capture_start(device, words.first, words.second); }; });
     capture->add_subcommand("stop", "stop all captures")->callback([&] { job = tool_capture_stop; });
@@ -75,6 +91,7 @@ void add_transfers(CLI::App &app, tool_words &words, tool_job &job)
         ->required()
         ->check(CLI::IsMember({"syslog", "qxdm"}));
     stream->add_option("--output", words.stream.output, "append it to a file");
+    stream->add_flag("--stop", words.stream.stop, "only have the device stop, whoever started it");
     add_limit(*stream, "--for", words.stream.length, "end by itself after that time");
     stream->callback([&] { job = [&](tool_device &device) { return tool_stream(device, words.stream); }; });
 }
@@ -86,7 +103,7 @@ void add_short_commands(CLI::App &app, tool_words &words, tool_job &job)
 
     CLI::App *syslog = app.add_subcommand("syslog", "show or set level and size of the device's system log");
     CLI::Option *level = syslog->add_option("LEVEL", words.first, "1 to 8: lines of a level below it are kept");
-    level->needs(syslog->add_option("SIZE", words.second, "in KB")->needs(level));
+    level->needs(syslog->add_option("SIZE", words.second, "in KB")->needs(level)->check(kDigits))->check(kDigits);
     syslog->callback(
         [&] { job = [&](tool_device &device) { return tool_syslog(device, words.first, words.second); }; });
 
@@ -96,7 +113,7 @@ void add_short_commands(CLI::App &app, tool_words &words, tool_job &job)
     bsp->callback([&] { job = [&](tool_device &device) { return tool_bsp(device, words.first, words.second); }; });
 
     CLI::App *modem = app.add_subcommand("modem", "show or switch the modem's mode");
-    modem->add_option("MODE", words.first, "lpm or online");
+    modem->add_option("MODE", words.first, "lpm or online")->check(CLI::IsMember({"lpm", "online"}));
     modem->callback([&] { job = [&](tool_device &device) { return tool_modem(device, words.first); }; });
 
     CLI::App *raw = app.add_subcommand("raw", "send a command as it is and print the reply");
@@ -108,6 +125,7 @@ void add_short_commands(CLI::App &app, tool_words &words, tool_job &job)
 
 int main(int argc, char **argv)
 {
+    tool_prepare_process();
     tool_device device;
     tool_words words;
     tool_job job;
@@ -120,5 +138,5 @@ int main(int argc, char **argv)
     add_transfers(app, words, job);
 
     CLI11_PARSE(app, argc, argv);
-    return job(device);
+    return tool_exit_status(job(device));
 }
