@@ -17,6 +17,8 @@ pthread_t recv_thread_id;
 namespace
 {
 
+bool g_cmd_owned LOG_GUARDED_BY(g_registry_lock);      /* whether cmd_fd has an owner */
+int g_sending_fd LOG_GUARDED_BY(g_registry_lock) = -1; /* what a frame is being sent on, as cmd_fd or before */
 bool g_turn_taken LOG_GUARDED_BY(g_registry_lock);
 pthread_cond_t g_turn_change = PTHREAD_COND_INITIALIZER; /* a turn has ended, or a connection was taken away */
 
@@ -36,29 +38,40 @@ int log_cmd_fd()
     return g_sock_fd.cmd_fd;
 }
 
-int log_cmd_take_away()
+log_cmd_taken log_cmd_take_away()
 {
-    int fd = -1;
+    log_cmd_taken taken{-1, 0};
+    bool owned = false;
     {
         const log_lock hold{g_registry_lock};
-        fd = std::exchange(g_sock_fd.cmd_fd, -1);
+        taken.fd = std::exchange(g_sock_fd.cmd_fd, -1);
+        taken.reader = std::exchange(recv_thread_id, 0);
         g_sock_fd.cmd_ssl = nullptr;
+        owned = g_cmd_owned;
+        /* Under the lock, as its owner can neither close it nor end meanwhile. */
+        if (taken.reader != 0)
+            pthread_cancel(taken.reader);
+        if (taken.fd != -1 && owned)
+            shutdown(taken.fd, SHUT_RDWR);
     }
     pthread_cond_broadcast(&g_turn_change);
-    if (fd == -1)
-        return -1;
-    if (recv_thread_id == 0)
-        close(fd);
-    else
-        shutdown(fd, SHUT_RDWR);
-    return fd;
+    if (taken.fd != -1 && !owned)
+        close(taken.fd);
+    return taken;
 }
 
 void log_cmd_record(int fd, const char *ip)
 {
     const log_lock hold{g_registry_lock};
     g_sock_fd.cmd_fd = fd;
+    g_cmd_owned = true;
     std::strncpy(client_ip, ip, sizeof client_ip - 1); /* clears the rest */
+}
+
+void log_cmd_disown()
+{
+    const log_lock hold{g_registry_lock};
+    g_cmd_owned = false;
 }
 
 const char *log_cmd_client_ip()
@@ -70,8 +83,10 @@ void log_cmd_serve(int fd)
 {
     t_served_fd = fd;
     const log_lock hold{g_registry_lock};
-    if (stands())
-        std::memcpy(t_served_ip, client_ip, sizeof t_served_ip);
+    if (!stands())
+        return;
+    recv_thread_id = pthread_self();
+    std::memcpy(t_served_ip, client_ip, sizeof t_served_ip);
 }
 
 bool log_cmd_stands()
@@ -82,21 +97,22 @@ bool log_cmd_stands()
 
 void log_cmd_close(int fd)
 {
+    bool sending = false;
     {
-        const log_lock turn{g_takeover_lock};
         const log_lock hold{g_registry_lock};
         if (g_sock_fd.cmd_fd == fd) {
             g_sock_fd.cmd_fd = -1;
             g_sock_fd.cmd_ssl = nullptr;
-            recv_thread_id = 0;
         }
+        if (pthread_equal(recv_thread_id, pthread_self()) != 0)
+            recv_thread_id = 0;
+        sending = g_sending_fd == fd;
     }
-    if (!g_cmd_send_lock.try_acquire()) {
+    if (sending) {
         shutdown(fd, SHUT_RDWR); /* wakes a sender that a stalled peer blocks */
-        g_cmd_send_lock.acquire();
+        const log_lock until_sent{g_cmd_send_lock};
     }
     close(fd);
-    g_cmd_send_lock.release();
 }
 
 log_cmd_use::log_cmd_use() : sending_(g_cmd_send_lock)
@@ -104,8 +120,14 @@ log_cmd_use::log_cmd_use() : sending_(g_cmd_send_lock)
     const log_lock hold{g_registry_lock};
     if (!stands())
         return;
-    fd_ = g_sock_fd.cmd_fd;
+    fd_ = g_sending_fd = g_sock_fd.cmd_fd;
     ssl_ = g_sock_fd.cmd_ssl;
+}
+
+log_cmd_use::~log_cmd_use()
+{
+    const log_lock hold{g_registry_lock};
+    g_sending_fd = -1;
 }
 
 log_cmd_turn::log_cmd_turn()

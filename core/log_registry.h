@@ -9,11 +9,10 @@
  *
  * The locks of the daemon, in the order in which one may be taken while another is held:
  *
- *   g_takeover_lock  one change of the command connection at a time: held while an accepted connection takes the
- *                    place of another, and while a receive thread gives its own up, but not while it waits to close
+ *   g_takeover_lock  one accepted connection at a time takes the place of another
  *   g_cmd_send_lock  one frame at a time on the command connection: held while it is sent (log_cmd_use)
  *   g_registry_lock  the fields of the registry. Held for a few instructions: no waiting for a peer, sending, logging
- *                    or starting of programs
+ *                    or starting of threads and programs
  *   g_block_lock     the blocks that wait for their next use (core/log_block.h); as short
  */
 #ifndef CORE_LOG_REGISTRY_H
@@ -45,19 +44,26 @@ extern log_sock_fd g_sock_fd LOG_GUARDED_BY(g_registry_lock);
 constexpr std::size_t kClientIpSize = 64;
 extern char client_ip[kClientIpSize] LOG_GUARDED_BY(g_registry_lock);
 
-/* The thread that reads the command connection in server mode; 0: none, and then nobody owns cmd_fd. It
- * stands here only while the thread lives, so that cancelling it is safe under the lock. */
-extern pthread_t recv_thread_id LOG_GUARDED_BY(g_takeover_lock);
+/* The thread that reads the command connection in server mode; 0: none yet, or no more. It stands here only while the
+ * thread lives, so that cancelling it is safe under the lock. */
+extern pthread_t recv_thread_id LOG_GUARDED_BY(g_registry_lock);
 
 /* The command connection's descriptor, for the log only; -1 when there is none. */
 int log_cmd_fd();
 
-/* Takes the command connection away from its thread, or closes it where it has none. Returns its descriptor,
- * for the log only, or -1 when there was none. */
-int log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
+/* A command connection that was taken away, for the log only. */
+struct log_cmd_taken {
+    int fd;           /* -1: there was none */
+    pthread_t reader; /* the thread that was cancelled; 0: none */
+};
 
-/* Records a log tool's connection as the command connection. Whoever reads it will own it. */
+/* Takes the command connection away from its owner, whose reading it cancels, or closes it where it has none. */
+log_cmd_taken log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
+
+/* Records a log tool's connection as the command connection, owned by the thread that is about to be started for it, or
+ * by nobody after log_cmd_disown(). */
 void log_cmd_record(int fd, const char *ip) LOG_REQUIRES(g_takeover_lock);
+void log_cmd_disown() LOG_REQUIRES(g_takeover_lock);
 
 /* The address of the log tool whose command connection the calling thread owns, also when another tool has taken its
  * place; empty for a thread that owns none. */
@@ -101,6 +107,9 @@ class log_cmd_use
 {
 public:
     log_cmd_use();
+    ~log_cmd_use();
+    log_cmd_use(const log_cmd_use &) = delete;
+    log_cmd_use &operator=(const log_cmd_use &) = delete;
     int fd() const { return fd_; }
     SSL *ssl() const { return ssl_; }
 

@@ -13,6 +13,7 @@
 #include <cstring>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
+#include <sched.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -103,21 +104,20 @@ int vex_create_server_socket_ipv6(int port, unique_fd *listener)
     return 0;
 }
 
-/* Starts the receive thread of the command connection and cancels the one of the connection before it. */
-void vex_log_recv_thread(int cmd_fd) LOG_REQUIRES(g_takeover_lock)
+/* Starts the receive thread of the command connection; `before` is the one that was cancelled for it. */
+void vex_log_recv_thread(int cmd_fd, pthread_t before) LOG_REQUIRES(g_takeover_lock)
 {
-    if (recv_thread_id != 0) {
-        pthread_cancel(recv_thread_id);
-        LOG_NOTE("%s:pthread_cancel threadID=[%llu]\n", __func__, static_cast<unsigned long long>(recv_thread_id));
-        recv_thread_id = 0;
-    }
+    const auto number = [](pthread_t thread) { return static_cast<unsigned long long>(thread); };
+    if (before != 0)
+        LOG_NOTE("%s:pthread_cancel threadID=[%llu]\n", __func__, number(before));
     log_thread_task task{};
     task.entry = log_recv_tcp_msg;
-    if (log_thread_create(&task, log_recv_argument(cmd_fd)) == 0)
-        recv_thread_id = task.thread_id;
-    else
+    if (log_thread_create(&task, log_recv_argument(cmd_fd)) != 0) {
         LOG_NOTE("[failed creat log_recv_tcp_msg \n");
-    LOG_NOTE("%s threadID=[%llu]\n", __func__, static_cast<unsigned long long>(recv_thread_id));
+        log_cmd_disown();
+        task.thread_id = 0;
+    }
+    LOG_NOTE("%s threadID=[%llu]\n", __func__, number(task.thread_id));
 }
 
 /* Waits for the next connection of the listener. None, after a log line and a pause, when accept failed. */
@@ -125,6 +125,8 @@ template <typename Address> unique_fd accept_next(const char *name, int listener
 {
     socklen_t len = sizeof *peer;
     unique_fd client{accept4(listener, reinterpret_cast<sockaddr *>(peer), &len, SOCK_CLOEXEC)};
+    if (log_cmd_fd() != -1)
+        sched_yield(); /* a tool that has just closed its connection need not be thrown out: its thread is about to end */
     if (!client) {
         LOG_NOTE("%s accept error %s(errno: %d) ", name, std::strerror(errno), errno);
         sleep(kAcceptPause);
@@ -135,14 +137,14 @@ template <typename Address> unique_fd accept_next(const char *name, int listener
 void serve_ipv4(const char *name, int client, const sockaddr_in &peer)
 {
     const log_lock turn{g_takeover_lock};
-    const int old_fd = log_cmd_take_away();
-    if (old_fd != -1)
-        LOG_NOTE("%s:close old fd[%d]", name, old_fd);
+    const log_cmd_taken old = log_cmd_take_away();
+    if (old.fd != -1)
+        LOG_NOTE("%s:close old fd[%d]", name, old.fd);
     char ip[kClientIpSize] = {};
     inet_ntop(AF_INET, &peer.sin_addr, ip, sizeof ip);
     log_cmd_record(client, ip);
     LOG_NOTE("%s: client ip[%s],fd=[%d]", name, ip, client);
-    vex_log_recv_thread(client);
+    vex_log_recv_thread(client, old.reader);
 }
 
 /* Writes all eight groups of the address, in lower-case hex without leading zeros: no "::". */
@@ -158,16 +160,14 @@ void print_ipv6(const in6_addr &address, char *text, std::size_t size)
 void serve_ipv6(const char *name, int client, const sockaddr_in6 &peer)
 {
     const log_lock turn{g_takeover_lock};
-    const int old_fd = log_cmd_fd();
-    if (old_fd != -1) {
+    if (const int old_fd = log_cmd_fd(); old_fd != -1)
         LOG_NOTE("%s:close fd[%d]", name, old_fd);
-        log_cmd_take_away();
-    }
+    const log_cmd_taken old = log_cmd_take_away();
     char ip[kClientIpSize] = {};
     print_ipv6(peer.sin6_addr, ip, sizeof ip);
     log_cmd_record(client, ip);
     LOG_NOTE("%s: client ipv6[%s],fd[%d] ", name, ip, client);
-    vex_log_recv_thread(client);
+    vex_log_recv_thread(client, old.reader);
 }
 
 /* Accepts for ever; returns only when listen fails. */
