@@ -13,10 +13,11 @@ struct log_daemon_state {
     int run_mode = 0;     /* 0 server mode, any other value client mode */
     int retry_count = 10; /* largest number of connect tries in client mode */
     int use_ssl = 0;      /* 1 when client mode runs over TLS: every read and write chooses by it */
-    /* Writes on a TLS session as SSL_write() does. Set with use_ssl by whoever brings TLS along: server mode
-     * has no use for a TLS library and the memory it takes, so nothing below the client's room is linked with
-     * one. */
+    /* What TLS does for those below the client's room. Set with use_ssl by whoever brings TLS along: server mode has no
+     * use for a TLS library and the memory it takes, so the daemon is not linked with one. Reads and writes wait. */
+    int (*ssl_read)(SSL *ssl, void *bytes, int len) = nullptr;
     int (*ssl_write)(SSL *ssl, const void *bytes, int len) = nullptr;
+    void (*close_ssl)(SSL *ssl, int free_context) = nullptr;
     std::atomic<int> syslog_realtime_on{0}; /* 1 while the system log is streamed instead of kept on the device */
     std::atomic<int> exit_flag{0};          /* set to 1 to end the process; start-up looks at it every 5 seconds */
 };

@@ -1,5 +1,7 @@
 #include "core/log_registry.h"
 
+#include "core/daemon_state.h"
+
 #include <cstring>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -74,6 +76,25 @@ void log_cmd_disown()
     g_cmd_owned = false;
 }
 
+void log_cmd_record_session(SSL *session)
+{
+    const log_lock hold{g_registry_lock};
+    g_sock_fd.cmd_ssl = session;
+}
+
+void log_cmd_record_link(int fd)
+{
+    const log_lock hold{g_registry_lock};
+    g_sock_fd.cmd_fd = fd;
+    g_cmd_owned = true;
+}
+
+SSL *log_cmd_session()
+{
+    const log_lock hold{g_registry_lock};
+    return g_sock_fd.cmd_ssl;
+}
+
 const char *log_cmd_client_ip()
 {
     return t_served_ip;
@@ -97,12 +118,13 @@ bool log_cmd_stands()
 
 void log_cmd_close(int fd)
 {
+    SSL *session = nullptr;
     bool sending = false;
     {
         const log_lock hold{g_registry_lock};
         if (g_sock_fd.cmd_fd == fd) {
             g_sock_fd.cmd_fd = -1;
-            g_sock_fd.cmd_ssl = nullptr;
+            session = std::exchange(g_sock_fd.cmd_ssl, nullptr);
         }
         if (pthread_equal(recv_thread_id, pthread_self()) != 0)
             recv_thread_id = 0;
@@ -112,6 +134,8 @@ void log_cmd_close(int fd)
         shutdown(fd, SHUT_RDWR); /* wakes a sender that a stalled peer blocks */
         const log_lock until_sent{g_cmd_send_lock};
     }
+    if (g_daemon.use_ssl == 1)
+        g_daemon.close_ssl(session, 1);
     close(fd);
 }
 

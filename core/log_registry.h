@@ -65,6 +65,13 @@ log_cmd_taken log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
 void log_cmd_record(int fd, const char *ip) LOG_REQUIRES(g_takeover_lock);
 void log_cmd_disown() LOG_REQUIRES(g_takeover_lock);
 
+/* Records the control link of client mode: its session, then its socket, owned by the calling thread. */
+void log_cmd_record_session(SSL *session);
+void log_cmd_record_link(int fd);
+
+/* The command connection's session; null without TLS. For its owner. */
+SSL *log_cmd_session();
+
 /* The address of the log tool whose command connection the calling thread owns, also when another tool has taken its
  * place; empty for a thread that owns none. */
 const char *log_cmd_client_ip();
@@ -79,7 +86,7 @@ bool log_cmd_stands();
 
 /*
  * The owner's last step: forgets the command connection `fd` unless another has taken its place, waits for a
- * frame that is just being sent on it, and closes it.
+ * frame that is just being sent on it, and closes it, after its session and the context of all sessions.
  */
 void log_cmd_close(int fd);
 

@@ -13,6 +13,8 @@
 #include <cstring>
 #include <fcntl.h>
 #include <memory>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
@@ -165,6 +167,20 @@ int log_send_packet(int fd, SSL *ssl, const void *buffer, int len)
             std::printf("log_send_packet complete, the write data size is %d\n", sent);
     }
     return sent;
+}
+
+void log_set_keepalive(int fd)
+{
+    const struct {
+        int level;
+        int option;
+        int value;
+    } settings[] = {{SOL_SOCKET, SO_KEEPALIVE, 1},
+                    {IPPROTO_TCP, TCP_KEEPIDLE, 60},
+                    {IPPROTO_TCP, TCP_KEEPINTVL, 10},
+                    {IPPROTO_TCP, TCP_KEEPCNT, 3}};
+    for (const auto &setting : settings)
+        setsockopt(fd, setting.level, setting.option, &setting.value, sizeof setting.value);
 }
 
 int log_hex_encode(const void *data, char *out, int count)

@@ -61,6 +61,10 @@ int vex_popen(const char *cmd, char *buffer, int size);
  */
 int log_send_packet(int fd, SSL *ssl, const void *buffer, int len);
 
+/* Has a connection found dead after 90 seconds of silence: its peer is probed after 60 seconds, then three times 10
+ * seconds apart. What a listener accepts inherits it. */
+void log_set_keepalive(int fd);
+
 /* ---- Texts ---- */
 
 /* Writes `count` bytes as upper-case hex, two characters a byte and a NUL, to `out`, which has room for

@@ -1,5 +1,7 @@
 /* The daemon's entry point: start-up, then the wait for its end. All work is done on the threads started
  * here. */
+#include "client/log_client_ctl.h"
+#include "client/log_tls.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_local_syslog.h"
@@ -11,6 +13,8 @@
 #include "transport/log_server.h"
 
 #include <charconv>
+#include <cstdio>
+#include <cstring>
 #include <unistd.h>
 
 namespace
@@ -60,6 +64,20 @@ void run_server_mode()
     vex_log_server_thread_ipv6();
 }
 
+/* 0 when the control link was started, else the status to end with. */
+int run_client_mode()
+{
+    char tls_off[8] = {};
+    vex_get_nv_item("log_use_ssl_disable", tls_off, sizeof tls_off);
+    if (std::strcmp(tls_off, "1") != 0) {
+        const log_tls_result result = log_tls_start();
+        if (result != log_tls_result::ready)
+            return result == log_tls_result::no_context ? -1 : 1;
+    }
+    vex_log_client_ctl_thread();
+    return 0;
+}
+
 void wait_for_exit()
 {
     while (g_daemon.exit_flag == 0)
@@ -79,11 +97,11 @@ int main(int argc, char **argv)
         return 0;
     log_restore_bsp_module_level();
     g_daemon.run_mode = read_run_mode();
-    if (g_daemon.run_mode != 0) {
-        LOG_FAULT("client mode is not part of this build, nothing to do\n");
-        return 1;
-    }
-    run_server_mode();
+    if (g_daemon.run_mode == 0)
+        run_server_mode();
+    else if (const int status = run_client_mode(); status != 0)
+        return status;
     wait_for_exit();
-    return 0;
+    std::fflush(nullptr);
+    _exit(0); /* other threads still run: nothing that they use may be torn down */
 }

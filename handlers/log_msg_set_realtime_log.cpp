@@ -196,9 +196,13 @@ int log_msg_set_realtime_log(const char *control, const unsigned char *data, std
         return -1;
     log_handler_received(__func__, control);
     realtime_request request;
-    if (read_request(tree.get(), &request))
-        serve(request);
-    else
+    if (!read_request(tree.get(), &request)) {
         reply({"", 0, ""}, kInternalError);
+    } else if (g_daemon.run_mode != 0) {
+        LOG_FAULT("live logs in client mode are not part of this build\n");
+        reply({"", 0, ""}, kInternalError);
+    } else {
+        serve(request);
+    }
     return 0;
 }

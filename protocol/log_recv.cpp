@@ -1,5 +1,6 @@
 #include "protocol/log_recv.h"
 
+#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
 #include "protocol/log_reassembly.h"
@@ -27,9 +28,13 @@ struct cmd_owner {
     const int fd;
 };
 
-/* The blocking read, the one place where the thread can be cancelled. */
+/* The blocking read, the one place where the thread can be cancelled. Nobody cancels one that reads a TLS session. */
 ssize_t read_piece(int fd, unsigned char *piece)
 {
+    if (g_daemon.use_ssl == 1) {
+        SSL *const session = log_cmd_session();
+        return session != nullptr ? g_daemon.ssl_read(session, piece, kLogPieceMax) : 0;
+    }
     pthread_setcancelstate(PTHREAD_CANCEL_ENABLE, nullptr);
     const ssize_t n = recv(fd, piece, kLogPieceMax, 0);
     pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);

@@ -38,12 +38,6 @@ TEST_F(Daemon, StartConsumesOneUnitOfItsCounter)
         EXPECT_EQ(0, daemon.logged("log_server_thread_proc"));
         EXPECT_EQ(off, get_nv("log_manage_switch"));
     }
-    set_nv("log_manage_switch", "1");
-    daemon_process client({"-a", "10.0.0.9", "-p", "5000"});
-    EXPECT_EQ(1, client.wait_exit());
-    EXPECT_EQ("1 10.0.0.9 5000",
-              get_nv("log_manage_mode") + ' ' + get_nv("log_server_addr") + ' ' + get_nv("log_server_port"));
-    EXPECT_EQ(1, client.logged("client mode is not part of this build"));
 }
 
 TEST_F(Daemon, TellsWhichDeviceItIs)

@@ -13,7 +13,9 @@ int tool_fail(int status, const std::string &why)
 
 bool tool_reach(tool_device &device, std::string &why)
 {
-    if (!device.link)
+    if (!device.link && device.called)
+        why = "the device has hung up";
+    else if (!device.link)
         device.link =
             tool_connect(device.host, device.port, device.limits,
                          ". Check the address, and that the device is on and its log daemon runs in server mode", why);
@@ -56,7 +58,7 @@ std::optional<tool_answer> tool_exchange(tool_device &device, const std::string 
 
 std::string tool_said(const tool_device &device, const tool_answer &answer)
 {
-    return device.host + " port " + device.port + ' ' + answer.reason;
+    return (device.link ? device.link->where : device.host + " port " + device.port) + ' ' + answer.reason;
 }
 
 std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status)

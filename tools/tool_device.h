@@ -22,6 +22,7 @@ struct tool_device {
     std::string port = "48888";
     tool_limits limits;
     bool json = false;             /* print replies as they came instead of words */
+    bool called = false;           /* it has called us, and cannot be reached in another way */
     std::optional<tool_link> link; /* once it was reached, until it fails */
 };
 

@@ -93,33 +93,57 @@ std::optional<tool_frame> take_frame(tool_link &link, std::size_t len)
                       {msg->data, static_cast<std::size_t>(msg->dataLen)}};
 }
 
+/* As recv(), over TLS or not; with EAGAIN, `wanted` says what to wait for. */
+ssize_t read_link(const tool_link &link, std::span<unsigned char> bytes, short &wanted)
+{
+    wanted = POLLIN;
+    if (!link.session)
+        return recv(link.fd.get(), bytes.data(), bytes.size(), 0);
+    errno = 0;
+    const int n = SSL_read(link.session.get(), bytes.data(), static_cast<int>(bytes.size()));
+    return tool_tls_result(link.session.get(), n, wanted);
+}
+
+/* As send(), in the same way. */
+ssize_t write_link(const tool_link &link, std::span<const unsigned char> bytes, short &wanted)
+{
+    wanted = POLLOUT;
+    if (!link.session)
+        return send(link.fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
+    errno = 0;
+    const int n = SSL_write(link.session.get(), bytes.data(), static_cast<int>(bytes.size()));
+    return tool_tls_result(link.session.get(), n, wanted);
+}
+
 /* Waits for more bytes and holds them; false, and why, when none come. */
 bool receive_some(tool_link &link, std::chrono::milliseconds first, std::string &why)
 {
     const bool answer = link.held.empty() && first == link.limits.reply;
     const auto limit = link.held.empty() ? first : link.limits.stall;
-    std::string interrupt;
-    if (!wait_ready(link.fd.get(), POLLIN, tool_clock::now() + limit, interrupt)) {
+    const auto end = tool_clock::now() + limit;
+    unsigned char piece[65536];
+    for (;;) {
+        short wanted = 0;
+        const ssize_t n = read_link(link, piece, wanted);
+        if (n > 0) {
+            link.held.insert(link.held.end(), piece, piece + n);
+            return true;
+        }
+        if (n == 0 || (errno != EAGAIN && errno != EINTR)) {
+            why = ended(link, n == 0 ? "the device closed it" : std::strerror(errno));
+            return false;
+        }
+        std::string interrupt;
+        if (wait_ready(link.fd.get(), wanted, end, interrupt))
+            continue;
         why = !interrupt.empty()
                   ? interrupt
                   : link.where + " sent nothing for " + tool_seconds(limit) +
-                        (answer ? ". Either it is still at work, then try again with a larger "
-                                  "--reply-timeout, or it does not know the command: such a one it leaves "
-                                  "unanswered"
-                                : " in the middle of an answer. Try again, or with a larger "
-                                  "--stall-timeout");
+                        (answer ? ". Either it is still at work, then try again with a larger --reply-timeout, or it "
+                                  "does not know the command: such a one it leaves unanswered"
+                                : " in the middle of an answer. Try again, or with a larger --stall-timeout");
         return false;
     }
-    unsigned char piece[65536];
-    const ssize_t n = recv(link.fd.get(), piece, sizeof piece, 0);
-    if (n > 0) {
-        link.held.insert(link.held.end(), piece, piece + n);
-        return true;
-    }
-    if (n < 0 && (errno == EAGAIN || errno == EINTR))
-        return true;
-    why = ended(link, n == 0 ? "the device closed it" : std::strerror(errno));
-    return false;
 }
 
 } // namespace
@@ -167,14 +191,15 @@ bool tool_send(tool_link &link, const std::string &control, std::span<const unsi
         why = "the command is too long for a frame";
         return false;
     }
-    for (std::size_t sent = 0; sent < static_cast<std::size_t>(len);) {
-        const ssize_t n = send(link.fd.get(), frame.data() + sent, static_cast<std::size_t>(len) - sent, MSG_NOSIGNAL);
+    for (std::span<const unsigned char> left(frame.data(), static_cast<std::size_t>(len)); !left.empty();) {
+        short wanted = 0;
+        const ssize_t n = write_link(link, left, wanted);
         if (n > 0) {
-            sent += static_cast<std::size_t>(n);
-        } else if (errno != EAGAIN && errno != EINTR) {
+            left = left.subspan(static_cast<std::size_t>(n));
+        } else if (n == 0 || (errno != EAGAIN && errno != EINTR)) {
             why = ended(link, std::strerror(errno));
             return false;
-        } else if (!wait_ready(link.fd.get(), POLLOUT, tool_clock::now() + link.limits.stall, why)) {
+        } else if (!wait_ready(link.fd.get(), wanted, tool_clock::now() + link.limits.stall, why)) {
             if (why.empty())
                 why = link.where + " took nothing for " + tool_seconds(link.limits.stall) +
                       ". It may be busy with another command: try again with a larger --stall-timeout";

@@ -9,6 +9,7 @@
 
 #include "platform/unique_fd.h"
 #include "protocol/log_pkg_codec.h"
+#include "tools/tool_tls.h"
 
 #include <chrono>
 #include <memory>
@@ -25,7 +26,8 @@ struct tool_limits {
 
 struct tool_link {
     unique_fd fd;
-    std::string where; /* the device's address and port, for messages */
+    tls_session session = nullptr; /* over TLS; ends before its socket */
+    std::string where;             /* the device's address and port, for messages */
     tool_limits limits;
     std::vector<unsigned char> held;                            /* received bytes behind the frames that were taken */
     std::unique_ptr<log_msg> msg = std::make_unique<log_msg>(); /* the frame being sent, or taken last */

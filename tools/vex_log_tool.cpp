@@ -4,6 +4,7 @@
 #include "tools/tool_config.h"
 #include "tools/tool_log.h"
 #include "tools/tool_process.h"
+#include "tools/tool_serve.h"
 #include "tools/tool_stream.h"
 
 #include <CLI/CLI.hpp>
@@ -121,6 +122,45 @@ void add_short_commands(CLI::App &app, tool_words &words, tool_job &job)
     raw->callback([&] { job = [&](tool_device &device) { return tool_raw(device, words.first); }; });
 }
 
+void add_commands(CLI::App &app, tool_words &words, tool_job &job)
+{
+    app.require_subcommand(1);
+    add_short_commands(app, words, job);
+    add_capture(app, words, job);
+    add_transfers(app, words, job);
+}
+
+/* Runs a command line for a device that has called. */
+int run_line(tool_device &device, const std::string &line)
+{
+    tool_words words;
+    tool_job job;
+    CLI::App app{"Commands for the device that has called."};
+    add_commands(app, words, job);
+    try {
+        app.parse(line);
+    } catch (const CLI::ParseError &error) {
+        return app.exit(error);
+    }
+    return job(device);
+}
+
+void add_serve(CLI::App &app, tool_serve_options &options, tool_job &job)
+{
+    CLI::App *serve = app.add_subcommand("serve", "be the log server that a device calls, and take commands for it");
+    serve->add_option("--listen", options.port, "port to be called at")
+        ->check(CLI::Range(1, 65535))
+        ->capture_default_str();
+    CLI::Option *plain = serve->add_flag("--plain", options.plain, "without TLS");
+    const auto add_file = [&](const char *name, std::string &file, const char *help) {
+        serve->add_option(name, file, help)->check(CLI::ExistingFile)->excludes(plain);
+    };
+    add_file("--cert", options.cert, "our certificate, a PEM file");
+    add_file("--key", options.key, "its key");
+    add_file("--ca", options.ca, "certificate that the devices' are signed by");
+    serve->callback([&] { job = [&](tool_device &device) { return tool_serve(device, options, run_line); }; });
+}
+
 } // namespace
 
 int main(int argc, char **argv)
@@ -129,13 +169,12 @@ int main(int argc, char **argv)
     tool_device device;
     tool_words words;
     tool_job job;
+    tool_serve_options serve;
     CLI::App app{"Controls and collects the diagnostic logs of a device."};
-    app.require_subcommand(1);
     app.fallthrough(); /* common options may stand behind the command too */
     add_common_options(app, device);
-    add_short_commands(app, words, job);
-    add_capture(app, words, job);
-    add_transfers(app, words, job);
+    add_commands(app, words, job);
+    add_serve(app, serve, job);
 
     CLI11_PARSE(app, argc, argv);
     return tool_exit_status(job(device));

@@ -26,11 +26,6 @@ constexpr int kPort = 48888;
 constexpr int kBacklog = 1;
 constexpr unsigned kAcceptPause = 1; /* seconds after a failed accept */
 
-/* A dead tool is found out after kProbeIdle + kProbes * kProbeInterval seconds of silence. */
-constexpr int kProbeIdle = 60;
-constexpr int kProbeInterval = 10;
-constexpr int kProbes = 3;
-
 void set_option(int fd, int level, int option, int value)
 {
     setsockopt(fd, level, option, &value, sizeof value);
@@ -40,10 +35,7 @@ void set_option(int fd, int level, int option, int value)
  * back. */
 void set_connection_options(int fd)
 {
-    set_option(fd, SOL_SOCKET, SO_KEEPALIVE, 1);
-    set_option(fd, IPPROTO_TCP, TCP_KEEPIDLE, kProbeIdle);
-    set_option(fd, IPPROTO_TCP, TCP_KEEPINTVL, kProbeInterval);
-    set_option(fd, IPPROTO_TCP, TCP_KEEPCNT, kProbes);
+    log_set_keepalive(fd);
     set_option(fd, IPPROTO_TCP, TCP_NODELAY, 1);
 }
 

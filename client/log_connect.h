@@ -1,0 +1,18 @@
+/* Outbound connections to the log server. Log lines bear the source "vex_log_manage". */
+#ifndef CLIENT_LOG_CONNECT_H
+#define CLIENT_LOG_CONNECT_H
+
+#include <openssl/ossl_typ.h>
+
+/*
+ * Connects to the first address of `host`, trying as often as the daemon's retry_count says, with 2 seconds after each
+ * failure; with TLS on, opens a session on the connection, which is not tried again.
+ *   host      address or name of the server, never null
+ *   port      its port
+ *   session   holds null; then the session, with TLS on
+ * The connected socket, close-on-exec and with keepalive on, which the caller closes (after the session); -1 on failure,
+ * which is logged. May take retry_count * 2 seconds and more. For any thread.
+ */
+int log_connect_server(const char *host, int port, SSL **session);
+
+#endif

@@ -1,0 +1,36 @@
+/*
+ * TLS towards the log server: the context that all links share, one session for each link, and the check of the server's
+ * certificate. Log lines bear the source "vex_log_manage".
+ *
+ * A session is read by one thread and written by others. Its socket is non-blocking; a lock of its own is held across
+ * one library call at a time, and waiting is done without it, so that a reader who waits never holds up a writer. Who
+ * owns the link closes the session, when nobody else can be using it any more.
+ */
+#ifndef CLIENT_LOG_TLS_H
+#define CLIENT_LOG_TLS_H
+
+#include <openssl/ossl_typ.h>
+
+/* How start-up goes on. */
+enum class log_tls_result {
+    ready,
+    no_context, /* the process ends with status -1 */
+    bad_files,  /* the process ends with status 1 */
+};
+
+/* Builds the context from the device's certificates, and has all sends and reads go over TLS from now on. What is wrong
+ * is logged. Start-up calls it before any other thread exists. */
+log_tls_result log_tls_start();
+
+/* Opens a session on a connected socket, which it makes non-blocking, and checks the server: within 30 seconds, or it has
+ * failed. 1, and the session in `*session`, or TLS is off; 0 failed (logged), and null in `*session`. For any thread. */
+int vex_open_ssl(int fd, SSL **session);
+
+/* 1 when the server's certificate is accepted, and says whose it is; 0 when not (logged). */
+int log_cert_check(SSL *session);
+
+/* Ends a session, which may be null, and with `free_context` the shared context: no session can be opened then. Does
+ * nothing when TLS is off. */
+void vex_close_ssl(SSL *session, int free_context);
+
+#endif

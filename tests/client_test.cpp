@@ -1,0 +1,163 @@
+#include "tests/daemon.h"
+
+#include <fstream>
+
+namespace
+{
+
+constexpr char kCertDir[] = "/usr/vex/vex_conf/logcert/";
+const std::string kTls = " --cert /tmp/c/server.crt --key /tmp/c/server.key --ca /tmp/c/ca.crt ";
+
+/* The checkout's own programs for a device. */
+std::string device_program(const char *name)
+{
+    std::string path = SOURCE_DIR "/device/";
+    return path += name;
+}
+
+class Client : public testing::Test
+{
+protected:
+    void SetUp() override { ASSERT_EQ("", run_command(device_program("certificates") + " /tmp/c")); }
+    /* A shell line in the background that runs until the device has been served. */
+    static void start_server(const std::string &line)
+    {
+        run_command("rm -f /tmp/served; mkfifo /tmp/served; (" + line +
+                    " >/tmp/said 2>&1; echo $? >/tmp/served) >/dev/null 2>&1 &");
+        run_command("until grep -q ':1388 .* 0A ' /proc/net/tcp /proc/net/tcp6; do sleep 0.01; done");
+    }
+    static std::string server_status() { return run_command("cat /tmp/served"); }
+    static std::string server_said() { return read_file("/tmp/said"); }
+};
+
+TEST_F(Client, ServesTheServerThatItCalls)
+{
+    const struct {
+        const char *name;
+        std::string options;
+        const char *tls_off;
+        const char *address;
+        const char *calls;
+    } cases[] = {
+        {"plain", " --plain", "1", "127.0.0.1", "127.0.0.1 calls: model VX-520, software VX520_V1.4.2_B07, IMEI"},
+        {"tls", kTls, "0", "::1", "::1 calls over TLS: model VX-520"},
+        {"by name", kTls, "", "localhost", " calls over TLS: model VX-520"}};
+    run_command("head -c 3000000 /dev/urandom >/logfs/noise; mkdir -p /tmp/p/conf; touch /tmp/p/conf/Diag.cfg; "
+                "tar -cf /tmp/p.tar -C /tmp/p conf");
+    for (const auto &c : cases) {
+        set_nv("log_use_ssl_disable", c.tls_off);
+        start_server("printf 'version\\nbsp usb err\\narchive /tmp/a.tgz\\nmodem\\nconfig /tmp/p.tar\\n' | "
+                     "vex_log_tool serve --listen 5000" +
+                     c.options);
+        daemon_process daemon({"-a", c.address, "-p", "5000x", "-r", "3"});
+        EXPECT_EQ("0\n", server_status()) << server_said();
+        EXPECT_EQ(0, daemon.wait_exit());
+        const std::string said = server_said();
+        for (const char *words : {c.calls, "IMEI              356938035643809\n", "usb: log level err: the device was",
+                                  "Log archive stored as", "set to: online\n", "taken the package of 10240 bytes"})
+            EXPECT_NE(std::string::npos, said.find(words)) << c.name << ' ' << words << '\n' << said;
+        EXPECT_EQ("", run_command("tar -xOzf /tmp/a.tgz logfs/noise | cmp - /logfs/noise")) << c.name;
+        EXPECT_EQ(1, daemon.logged("vex_log_manage exit "));
+        EXPECT_EQ(c.tls_off == std::string("1") ? 0 : 1, daemon.logged("very good ,log_server check ok "));
+        EXPECT_EQ(0, daemon.logged("log_server_thread_proc"));
+    }
+}
+
+TEST_F(Client, TrustsNoServerWithoutItsCertificate)
+{
+    std::ofstream("/tmp/c/ca.cnf") << "[ca]\ndefault_ca=d\n[d]\ndatabase=db\nserial=serial\nnew_certs_dir=.\n"
+                                      "default_md=sha256\npolicy=p\n[p]\ncommonName=supplied\n";
+    const std::string sign =
+        "cd /tmp/c; rm -f db*; touch db; echo 01 >serial; openssl ca -batch -config ca.cnf -cert ca.crt "
+        "-keyfile ca.key -in server.csr -out bad.crt -notext ";
+    const struct {
+        std::string make;
+        const char *options;
+        bool accepted;
+    } cases[] = {
+        {sign + "-days 30", "-tls1_2", true}, /* it asks for none of ours, too */
+        {sign + "-days 30", "-tls1_3", true},
+        {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", false},
+        {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", false},
+        {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "", false},
+        {device_program("certificates") + " /tmp/o; cp /tmp/c/ca.crt " + kCertDir +
+             "logca_cert.crt; cp /tmp/o/server.crt /tmp/c/bad.crt; cp /tmp/o/server.key /tmp/c",
+         "", false},
+    };
+    for (const auto &c : cases) {
+        run_command(c.make);
+        start_server("sleep 0.5 | openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/bad.crt "
+                     "-key /tmp/c/server.key 2>/dev/null " +
+                     std::string(c.options));
+        daemon_process daemon({"-a", "127.0.0.1", "-p", "5000", "-r", "3"});
+        EXPECT_EQ(0, daemon.wait_exit());
+        server_status();
+        EXPECT_EQ(c.accepted, server_said().find("ControlLink") != std::string::npos) << c.make << server_said();
+        EXPECT_EQ(c.accepted ? 0 : 1, daemon.logged("vex_open_ssl: SSL connect error ")) << c.make;
+        EXPECT_EQ(c.accepted ? 0 : 1, daemon.logged("fail connect to address: 127.0.0.1, port number: 5000"));
+        EXPECT_EQ(1, daemon.logged("Trying to connect")) << "a session is not tried again";
+    }
+}
+
+TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
+{
+    const struct {
+        std::string spoil;
+        std::string words;
+    } cases[] = {
+        {"mv logca_cert.crt x", "Failed to load CA file /usr/vex/vex_conf/logcert/logca_cert.crt"},
+        {"mv x logca_cert.crt; echo >logclient_cert.crt",
+         "Failed to load user certificate file /usr/vex/vex_conf/logcert/logclient_cert.crt"},
+        {"cp /tmp/c/device.crt logclient_cert.crt; echo >logkey.pem", "[ERROR]use private key fail!"},
+        {"cp /tmp/c/server.key logkey.pem", "[ERROR]use private key fail!"},
+    };
+    for (const auto &c : cases) {
+        run_command(std::string("cd ") + kCertDir + "; " + c.spoil);
+        daemon_process daemon({"-a", "127.0.0.1"});
+        EXPECT_EQ(1, daemon.wait_exit()) << c.spoil;
+        EXPECT_EQ(1, daemon.logged(" 0 vex_log_manage")) << c.spoil;
+        EXPECT_EQ(1, daemon.logged(c.words)) << daemon.log();
+        EXPECT_EQ(0, daemon.logged("log_client_ctl_thread_proc"));
+    }
+}
+
+TEST_F(Client, EndsWithItsServerWheneverThatIs)
+{
+    const struct {
+        std::string server;
+        const char *tls_off;
+        const char *words;
+    } cases[] = {
+        {"true | busybox nc -l -p 5000 -w 1", "0", "vex_open_ssl: SSL connect error "},
+        {"echo 'no TLS' | busybox nc -l -p 5000", "0", "vex_open_ssl: SSL connect error "},
+        {"true | vex_log_tool serve --listen 5000" + kTls, "0", "recv"},
+        {"printf '#~\\0\\0\\0\\036{\"msgid' | timeout 1 busybox nc -l -p 5000", "1", "recv data len =13"},
+        {"printf 'archive /dev/full/x\\n' | vex_log_tool serve --listen 5000 --plain", "1", "recvcount=0,client close"},
+    };
+    for (const auto &c : cases) {
+        set_nv("log_use_ssl_disable", c.tls_off);
+        start_server(c.server);
+        daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+        EXPECT_EQ(0, daemon.wait_exit()) << c.server;
+        EXPECT_NE(0, daemon.logged(c.words)) << c.server << daemon.log();
+        EXPECT_EQ(1, daemon.logged("vex_log_manage exit ")) << c.server;
+        server_status();
+    }
+}
+
+TEST_F(Client, EndsWithoutAServerToCall)
+{
+    for (const auto &[retries, tries] : {std::pair{"0", 0}, {"-1", 0}, {"1", 1}}) {
+        daemon_process daemon({"-a", "127.0.0.1", "-p", "9", "-r", retries});
+        EXPECT_EQ(0, daemon.wait_exit());
+        EXPECT_EQ(tries, daemon.logged("Error is ECONNREFUSED - No one is listening on the remote ip address"));
+        EXPECT_EQ(1, daemon.logged("fail connect to address: 127.0.0.1, port number: 9"));
+    }
+    set_nv("log_server_addr", "");
+    set_nv("log_manage_mode", "7");
+    daemon_process daemon({"-p", "5000"});
+    EXPECT_EQ(0, daemon.wait_exit());
+    EXPECT_EQ(1, daemon.logged("vex_log_manage exit "));
+}
+
+} // namespace

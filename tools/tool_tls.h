@@ -1,0 +1,33 @@
+/* TLS as a log server speaks it: it shows its certificate and demands the device's. */
+#ifndef TOOLS_TOOL_TLS_H
+#define TOOLS_TOOL_TLS_H
+
+#include "tools/tool_wait.h"
+
+#include <memory>
+#include <openssl/ssl.h>
+#include <string>
+#include <sys/types.h>
+
+struct tls_context_deleter {
+    void operator()(SSL_CTX *context) const { SSL_CTX_free(context); }
+};
+struct tls_session_deleter {
+    void operator()(SSL *session) const { SSL_free(session); }
+};
+
+using tls_context = std::unique_ptr<SSL_CTX, tls_context_deleter>;
+using tls_session = std::unique_ptr<SSL, tls_session_deleter>;
+
+/* A context from PEM files: the server's certificate and key, and the certificate that a device's must be signed by.
+ * None, and why, when they cannot be used. */
+tls_context tool_tls_server(const std::string &cert, const std::string &key, const std::string &ca, std::string &why);
+
+/* Shakes hands on an accepted, non-blocking socket until `end`. None, and why, when that fails. */
+tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why);
+
+/* A result as recv() and send() have it: bytes, 0 at the end, -1 with errno, EAGAIN when the socket is to be waited for,
+ * for `wanted`. */
+ssize_t tool_tls_result(SSL *session, int result, short &wanted);
+
+#endif
