@@ -41,6 +41,14 @@ json_tree log_handler_parse(const char *control)
     return request;
 }
 
+json_tree log_handler_take(const char *name, const char *control, const unsigned char *data)
+{
+    if (!log_handler_entered(name, control, data))
+        return nullptr;
+    log_handler_received(name, control);
+    return log_handler_parse(control);
+}
+
 const char *log_member_text(const cJSON *object, const char *name, const char *what)
 {
     const char *text = cJSON_GetStringValue(cJSON_GetObjectItem(object, name));

@@ -25,6 +25,9 @@ void log_handler_received(const char *name, const char *control);
 /* Parses the request; null, after a log line, when it is not JSON. */
 json_tree log_handler_parse(const char *control);
 
+/* These three in a row, as most handlers begin. Null when the request is to be dropped. */
+json_tree log_handler_take(const char *name, const char *control, const unsigned char *data);
+
 /* Members of a request, letter case of their names ignored. Null, after the log line "cannot find WHAT item", when one
  * is missing or of another type. They live as long as the tree. */
 const char *log_member_text(const cJSON *object, const char *name, const char *what);

@@ -35,10 +35,7 @@ void switch_mode(const char *mode, int command)
 
 int log_msg_mode_lpm_online(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
 {
-    if (!log_handler_entered(__func__, control, data))
-        return -1;
-    log_handler_received(__func__, control);
-    const json_tree request = log_handler_parse(control);
+    const json_tree request = log_handler_take(__func__, control, data);
     if (!request)
         return -1;
     const char *mode = log_member_text(request.get(), "mode_lpm_online", "mode_lpm_online");

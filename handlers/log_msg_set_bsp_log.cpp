@@ -55,10 +55,7 @@ void serve(const bsp_request &request)
 
 int log_msg_set_bsp_log(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
 {
-    if (!log_handler_entered(__func__, control, data))
-        return -1;
-    log_handler_received(__func__, control);
-    const json_tree tree = log_handler_parse(control);
+    const json_tree tree = log_handler_take(__func__, control, data);
     if (!tree)
         return -1;
     bsp_request request{};

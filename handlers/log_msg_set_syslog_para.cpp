@@ -79,10 +79,7 @@ void reply_stored()
 
 int log_msg_set_syslog_para(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
 {
-    if (!log_handler_entered(__func__, control, data))
-        return -1;
-    log_handler_received(__func__, control);
-    const json_tree request = log_handler_parse(control);
+    const json_tree request = log_handler_take(__func__, control, data);
     if (!request)
         return -1;
     syslog_para para;

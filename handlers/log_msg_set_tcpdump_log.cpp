@@ -82,10 +82,7 @@ void start_captures(const capture_request &capture)
 
 int log_msg_set_tcpdump_log(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
 {
-    if (!log_handler_entered(__func__, control, data))
-        return -1;
-    log_handler_received(__func__, control);
-    const json_tree request = log_handler_parse(control);
+    const json_tree request = log_handler_take(__func__, control, data);
     if (!request)
         return -1;
     capture_request capture;
