@@ -22,7 +22,7 @@ protected:
     /* A shell line in the background that runs until the device has been served. */
     static void start_server(const std::string &line)
     {
-        run_command("rm -f /tmp/served; mkfifo /tmp/served; (" + line +
+        run_command("rm -f /tmp/served /tmp/said; mkfifo /tmp/served; (" + line +
                     " >/tmp/said 2>&1; echo $? >/tmp/served) >/dev/null 2>&1 &");
         run_command("until grep -q ':1388 .* 0A ' /proc/net/tcp /proc/net/tcp6; do sleep 0.01; done");
     }
@@ -85,10 +85,12 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
          "", false},
     };
     for (const auto &c : cases) {
-        run_command(c.make);
-        start_server("sleep 0.5 | openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/bad.crt "
-                     "-key /tmp/c/server.key 2>/dev/null " +
-                     std::string(c.options));
+        run_command(c.make + "; rm -f /tmp/daemon.log");
+        start_server(
+            "until grep -q ControlLink /tmp/said || grep -q 'connect error' /tmp/daemon.log; do sleep 0.01; done | "
+            "openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/bad.crt "
+            "-key /tmp/c/server.key 2>/dev/null " +
+            std::string(c.options));
         daemon_process daemon({"-a", "127.0.0.1", "-p", "5000", "-r", "3"});
         EXPECT_EQ(0, daemon.wait_exit());
         server_status();
