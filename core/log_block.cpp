@@ -22,7 +22,7 @@ void *log_block_take()
         if (g_kept_count > 0)
             return g_kept[--g_kept_count];
     }
-    return std::malloc(kLogBlockSize);
+    return std::aligned_alloc(64, kLogBlockSize);
 }
 
 void log_block_give(void *block)

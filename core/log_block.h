@@ -12,7 +12,7 @@
 
 constexpr std::size_t kLogBlockSize = 128 * 1024;
 
-/* A block of kLogBlockSize bytes, aligned for any type, holding whatever its last user left in it; null
+/* A block of kLogBlockSize bytes, aligned to 64, holding whatever its last user left in it; null
  * without memory. */
 void *log_block_take();
 

@@ -4,6 +4,7 @@
 
 #include "protocol/log_pkg_codec.h"
 
+#include <cstddef>
 #include <openssl/ossl_typ.h>
 
 /*
@@ -20,9 +21,11 @@ int log_send_pkg_msg(int fd, SSL *ssl, const char *control, const void *data, in
 
 /* A frame on its way out, in a block (core/log_block.h); it is encoded where it lies. */
 struct log_outgoing {
+    unsigned char front[52]; /* so that the data is aligned, which makes copying it cheaper */
     log_msg msg;
     unsigned char rest[kPkgSendBuf]; /* so that from anywhere in the record there are kPkgSendBuf bytes to write to */
 };
+static_assert((offsetof(log_outgoing, msg) + offsetof(log_msg, data)) % 64 == 0);
 
 /* The same for `dataLen` bytes of data that are already in `piece->msg.data`, and stay there: a piece of a file is
  * sent without being copied. */
