@@ -1,28 +1,11 @@
-/*
- * Measures the daemon on a simulated device, each figure beside a floor in the same run: rounds of both
- * alternate, and the medians are compared. Daemon, floor and this program share one processor, so that a
- * round trip costs what the work costs and not what waking another processor costs.
- */
-#include "platform/unique_fd.h"
+/* Measures the daemon in server mode, on a simulated device. */
+#include "bench/measure.h"
 
-#include <algorithm>
-#include <arpa/inet.h>
-#include <cerrno>
-#include <chrono>
-#include <csignal>
 #include <cstdio>
-#include <cstdlib>
-#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
-#include <functional>
-#include <netinet/in.h>
-#include <netinet/tcp.h>
 #include <sched.h>
-#include <string>
 #include <sys/socket.h>
-#include <sys/wait.h>
-#include <vector>
 
 namespace
 {
@@ -39,7 +22,6 @@ constexpr std::uint16_t kUploadFloorPort = 7779;
 constexpr std::uint16_t kShellFloorPort = 7780;
 
 constexpr int kTransferRounds = 15;
-constexpr std::size_t kArchiveSize = 256 << 20;
 constexpr int kUploadRounds = 201;
 constexpr int kUploadFrames = 20;
 constexpr std::size_t kUploadSize = 50000;
@@ -53,8 +35,7 @@ struct command {
 
 command make_command(const char *what, const std::string &control, const std::string &reply)
 {
-    const std::string head("#~\0\0\0", 5);
-    return {what, head + static_cast<char>(control.size()) + control + std::string("\0\0\0\0~#", 6), reply.size() + 12};
+    return {what, make_frame(control), reply.size() + 12};
 }
 
 /* Neither runs a program; the first touches nothing but the daemon, the second reads an NV item, which is a
@@ -64,118 +45,12 @@ const command kRefused = make_command("a refused mode", R"({"msgid":"11","mode_l
 const command kQuery = make_command("the mode, from NV", R"({"msgid":"11","mode_lpm_online":""})",
                                     R"({"msgid":"11","mode_lpm_online":"online","Result":"Success"})");
 
-double now()
-{
-    return std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch()).count();
-}
-
-[[noreturn]] void give_up(const char *what)
-{
-    std::perror(what);
-    std::exit(1);
-}
-
-void shell(const char *command)
-{
-    if (std::system(command) != 0)
-        give_up(command);
-}
-
-/* A program that runs as long as this lives, its output dropped. */
-class program
-{
-public:
-    explicit program(const std::vector<std::string> &words) : pid_(fork())
-    {
-        if (pid_ != 0)
-            return;
-        std::vector<char *> argv;
-        for (const std::string &word : words)
-            argv.push_back(const_cast<char *>(word.c_str()));
-        argv.push_back(nullptr);
-        const int null = open("/dev/null", O_RDWR | O_CLOEXEC);
-        dup2(null, STDOUT_FILENO);
-        dup2(null, STDERR_FILENO);
-        execvp(argv[0], argv.data());
-        _exit(127);
-    }
-    ~program()
-    {
-        if (pid_ > 0)
-            kill(pid_, SIGKILL);
-        wait();
-    }
-    program(const program &) = delete;
-    program &operator=(const program &) = delete;
-
-    pid_t pid() const { return pid_; }
-    void wait()
-    {
-        if (pid_ > 0)
-            waitpid(std::exchange(pid_, -1), nullptr, 0);
-    }
-
-private:
-    pid_t pid_;
-};
-
-/* A connection, tried again until somebody listens there. */
-unique_fd connect_to(std::uint16_t port)
-{
-    sockaddr_in to{};
-    to.sin_family = AF_INET;
-    to.sin_port = htons(port);
-    to.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    unique_fd fd{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
-    const double end = now() + 10;
-    while (connect(fd.get(), reinterpret_cast<const sockaddr *>(&to), sizeof to) != 0) {
-        if (errno != ECONNREFUSED || now() > end)
-            give_up("connect");
-        sched_yield();
-    }
-    const int on = 1;
-    setsockopt(fd.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
-    return fd;
-}
-
 void round_trip(int fd, const std::string &frame, std::size_t reply_size)
 {
     char reply[256];
     if (send(fd, frame.data(), frame.size(), 0) != static_cast<ssize_t>(frame.size()) ||
         recv(fd, reply, reply_size, MSG_WAITALL) != static_cast<ssize_t>(reply_size))
         give_up("round trip");
-}
-
-/* Microseconds that one of `count` repetitions takes. */
-double timed(int count, const std::function<void()> &work)
-{
-    const double start = now();
-    for (int i = 0; i < count; ++i)
-        work();
-    return (now() - start) * 1e6 / count;
-}
-
-double median(std::vector<double> values)
-{
-    const auto middle = values.begin() + static_cast<std::ptrdiff_t>(values.size() / 2);
-    std::nth_element(values.begin(), middle, values.end());
-    return *middle;
-}
-
-struct comparison {
-    double daemon;
-    double floor;
-};
-
-/* Medians of alternating rounds. */
-comparison compare(int rounds, const std::function<double()> &daemon, const std::function<double()> &floor)
-{
-    std::vector<double> daemon_rounds, floor_rounds;
-    for (int round = 0; round < rounds; ++round) {
-        floor_rounds.push_back(floor());
-        daemon_rounds.push_back(daemon());
-    }
-    return {median(daemon_rounds), median(floor_rounds)};
 }
 
 /* The floor sends the command's own bytes back. */
@@ -190,7 +65,7 @@ void measure_round_trips(const command &command)
         kRounds, [&] { return round(daemon.get(), command.reply_size); },
         [&] { return round(floor.get(), command.frame.size()); });
     std::printf("round trip, %-18s %8.2f us   bare echo         %8.2f us   ratio %.3f\n", command.what, us.daemon,
-                us.floor, us.daemon / us.floor);
+                us.floor, us.ratio);
 }
 
 void measure_connections(const command &command)
@@ -202,60 +77,28 @@ void measure_connections(const command &command)
         kRounds, [&] { return rate(kDaemonPort, command.reply_size); },
         [&] { return rate(kFloorPort, command.frame.size()); });
     std::printf("connect, %-18s    %8.0f /s   bare server       %8.0f /s   ratio %.3f\n", command.what, per_s.daemon,
-                per_s.floor, per_s.daemon / per_s.floor);
+                per_s.floor, per_s.ratio);
 }
 
-/* Reads frames until the file that they carry is complete; seconds from the first byte on. */
-double read_archive(int fd)
-{
-    static char piece[1 << 18];
-    const std::size_t frames = (kArchiveSize + 51199) / 51200;
-    std::size_t left = 0;
-    double start = 0;
-    do {
-        const ssize_t n = recv(fd, piece, sizeof piece, 0);
-        if (n <= 0)
-            give_up("archive");
-        if (start == 0) { /* the first frame begins here, and all have its control text */
-            start = now();
-            left = kArchiveSize + frames * (12 + static_cast<unsigned char>(piece[5]));
-        }
-        left -= static_cast<std::size_t>(n);
-    } while (left > 0);
-    return now() - start;
-}
-
-/* Largest memory that the process ever had, in KiB. */
-long peak_kib(pid_t pid)
-{
-    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-    for (std::string line; std::getline(status, line);)
-        if (line.rfind("VmHWM:", 0) == 0)
-            return std::stol(line.substr(6));
-    return -1;
-}
-
-/* A stand-in for tar "packs" a file that is already there, so that only the sending counts. */
 void measure_archive(const std::string &floor_server, pid_t daemon_pid)
 {
-    shell("head -c 268435456 /dev/urandom >/tmp/big; printf '#!/bin/sh\\nln /tmp/big $2\\n' "
-          ">/usr/vex/override/tar; chmod 755 /usr/vex/override/tar");
+    stand_in_for_tar();
     const program floor_process({floor_server, "archive", std::to_string(kArchiveFloorPort), "/tmp/big"});
     const unique_fd daemon = connect_to(kDaemonPort);
     const unique_fd floor = connect_to(kArchiveFloorPort);
-    const std::string ask = make_command("", R"({"msgid":"2"})", "").frame;
+    const std::string ask = make_frame(R"({"msgid":"2"})");
     const auto fetch = [&ask](int fd) {
         if (send(fd, ask.data(), ask.size(), 0) != static_cast<ssize_t>(ask.size()))
             give_up("send");
-        return read_archive(fd);
+        return read_archive([fd](void *bytes, std::size_t len) { return recv(fd, bytes, len, 0); });
     };
     const long before = peak_kib(daemon_pid);
     const comparison s = compare(
         kTransferRounds, [&] { return fetch(daemon.get()); }, [&] { return fetch(floor.get()); });
     std::printf("archive of 256 MB              %8.0f MB/s   plain program    %8.0f MB/s   ratio %.3f\n",
-                kArchiveSize / s.daemon / 1e6, kArchiveSize / s.floor / 1e6, s.floor / s.daemon);
+                kArchiveSize / s.daemon / 1e6, kArchiveSize / s.floor / 1e6, 1 / s.ratio);
     std::printf("  the daemon's peak memory     %8ld KiB, %ld KiB before\n", peak_kib(daemon_pid), before);
-    shell("rm /tmp/big /usr/vex/override/tar");
+    restore_tar();
 }
 
 void measure_upload(const std::string &floor_server)
@@ -264,7 +107,7 @@ void measure_upload(const std::string &floor_server)
     const unique_fd daemon = connect_to(kDaemonPort);
     const unique_fd floor = connect_to(kUploadFloorPort);
     const std::string control = R"({"msgid":"1","conf_file":{"totalLength":"2000000000"}})";
-    std::string frame = make_command("", control, "").frame;
+    std::string frame = make_frame(control);
     frame.replace(6 + control.size(), 4, std::string("\0\0\xc3\x50", 4)).insert(10 + control.size(), kUploadSize, 'x');
     const auto round = [&frame](int fd, std::size_t reply_size, const char *file) {
         const double us = timed(kUploadFrames, [&] { round_trip(fd, frame, reply_size); });
@@ -277,7 +120,7 @@ void measure_upload(const std::string &floor_server)
         kUploadRounds, [&] { return round(daemon.get(), reply_size, "/logfs/logconf.tar"); },
         [&] { return round(floor.get(), 12, "/logfs/floor.tar"); });
     std::printf("upload by frames of 50000      %8.0f MB/s   plain program    %8.0f MB/s   ratio %.3f\n",
-                kUploadSize / us.daemon, kUploadSize / us.floor, us.floor / us.daemon);
+                kUploadSize / us.daemon, kUploadSize / us.floor, 1 / us.ratio);
 }
 
 void measure_first_reply(const std::string &floor_server)
@@ -287,7 +130,7 @@ void measure_first_reply(const std::string &floor_server)
                                  "df -h | grep /logfs |awk '{print $2}' | cut -d 'M' -f 1"});
     const unique_fd daemon = connect_to(kDaemonPort);
     const unique_fd floor = connect_to(kShellFloorPort);
-    const std::string ask = make_command("", R"({"msgid":"3"})", "").frame;
+    const std::string ask = make_frame(R"({"msgid":"3"})");
     const auto first_byte = [&ask](int fd) {
         return timed(1, [&] {
             char reply[2048];
@@ -298,7 +141,7 @@ void measure_first_reply(const std::string &floor_server)
     const comparison us = compare(
         kShellRounds, [&] { return first_byte(daemon.get()); }, [&] { return first_byte(floor.get()); });
     std::printf("first byte of the version      %8.2f ms   its shell lines  %8.2f ms   ratio %.3f\n", us.daemon / 1e3,
-                us.floor / 1e3, us.daemon / us.floor);
+                us.floor / 1e3, us.ratio);
 }
 
 /* Sum of the lines "Private_...: N kB" of the process. */
@@ -353,12 +196,7 @@ int main(int argc, char **argv)
 {
     if (argc != 2)
         return 2;
-    cpu_set_t one;
-    CPU_ZERO(&one);
-    CPU_SET(0, &one);
-    sched_setaffinity(0, sizeof one, &one); /* children too */
-    setenv("VEX_LOG_LEVEL", "0", 1);
-
+    prepare_measuring();
     {
         const program floor({argv[1], "echo", std::to_string(kFloorPort)});
         const program daemon({"vex_log_manage"});

@@ -7,6 +7,7 @@
  *   floor_server shell PORT CMD...    captures what shell commands print and answers, for each command that it reads
  *   floor_server system CMD           runs a shell command and syncs, as the daemon does with each of its commands
  */
+#include "bench/archive_frames.h"
 #include "platform/unique_fd.h"
 
 #include <arpa/inet.h>
@@ -19,13 +20,11 @@
 #include <netinet/tcp.h>
 #include <pthread.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
 namespace
 {
 
-constexpr std::size_t kPieceSize = 51200;  /* of an archive */
 constexpr std::size_t kUploadSize = 50000; /* data bytes of an upload's frame */
 constexpr std::size_t kReadSize = 2000;
 
@@ -50,29 +49,10 @@ void echo(int fd)
 void send_archive(int fd)
 {
     char command[kReadSize];
-    static char frame[kPieceSize + 2048];
-    while (recv(fd, command, sizeof command, 0) > 0) {
-        const unique_fd file{open(g_words[0], O_RDONLY | O_CLOEXEC)};
-        struct stat about {
-        };
-        fstat(file.get(), &about);
-        const int control_len = std::snprintf(
-            frame + 6, 2000, "{\"msgid\":\"2\",\"GetLocalLog\":{\"totalLength\":\"%d\"},\"Result\":\"Success\"}",
-            static_cast<int>(about.st_size));
-        const auto put_length = [](char *at, std::size_t len) {
-            const std::uint32_t big_endian = htonl(static_cast<std::uint32_t>(len));
-            std::memcpy(at, &big_endian, 4);
-        };
-        char *const data = frame + 6 + control_len + 4;
-        std::memcpy(frame, "#~", 2);
-        put_length(frame + 2, static_cast<std::size_t>(control_len));
-        for (ssize_t n = 0; (n = read(file.get(), data, kPieceSize)) > 0;) {
-            put_length(data - 4, static_cast<std::size_t>(n));
-            std::memcpy(data + n, "~#", 2);
-            if (!send_whole(fd, frame, static_cast<std::size_t>(data + n + 2 - frame)))
-                return;
-        }
-    }
+    while (recv(fd, command, sizeof command, 0) > 0)
+        if (!send_archive_file(g_words[0],
+                               [fd](const char *bytes, std::size_t len) { return send_whole(fd, bytes, len); }))
+            return;
 }
 
 bool append_synced(const char *data)
