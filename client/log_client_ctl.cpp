@@ -63,8 +63,8 @@ void *log_client_ctl_thread_proc(void *)
 {
     LOG_NOTE("enter %s.\n", __func__);
     serve_link();
-    g_daemon.exit_flag = 1;
     LOG_NOTE("vex_log_manage exit \n");
+    g_daemon.exit_flag = 1; /* last: the process may end before this thread does anything more */
     return nullptr;
 }
 

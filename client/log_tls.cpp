@@ -1,19 +1,15 @@
 #include "client/log_tls.h"
 
 #include "client/tls_library.h"
+#include "client/tls_session.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_lock.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
-#include <climits>
 #include <cstring>
-#include <fcntl.h>
 #include <memory>
-#include <new>
-#include <poll.h>
 
 namespace
 {
@@ -24,96 +20,11 @@ constexpr char kCaFile[] = "/usr/vex/vex_conf/logcert/logca_cert.crt";
 constexpr char kCertFile[] = "/usr/vex/vex_conf/logcert/logclient_cert.crt";
 constexpr char kKeyFile[] = "/usr/vex/vex_conf/logcert/logkey.pem";
 
-using clock_type = std::chrono::steady_clock;
-
 constexpr auto kHandshakeMax = std::chrono::seconds(30);
-constexpr auto kForEver = clock_type::time_point::max();
-/* What a call waits for, another thread's call on the session may have taken off the socket: a wait for the direction
- * that is not the call's own is looked at again. */
-constexpr auto kLookAgain = std::chrono::milliseconds(100);
 
 /* Guards the pointer to the context, which is given up while a data link may be opening a session. */
 log_mutex g_context_lock;
 SSL_CTX *g_ssl_ctx LOG_GUARDED_BY(g_context_lock);
-
-/* What a session carries with it. */
-struct session_extra {
-    log_mutex lock; /* held across one library call */
-};
-
-session_extra *extra_of(SSL *session)
-{
-    return static_cast<session_extra *>(g_tls.SSL_get_ex_data(session, 0));
-}
-
-void free_session(SSL *session)
-{
-    session_extra *const extra = extra_of(session);
-    g_tls.SSL_free(session);
-    delete extra;
-}
-
-/* Waits until the socket is ready, or the time has come: then false. */
-bool wait_for(int fd, short events, clock_type::time_point end)
-{
-    pollfd entry{fd, events, 0};
-    int ms = -1;
-    if (end != kForEver) {
-        const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - clock_type::now()).count();
-        ms = static_cast<int>(std::clamp<decltype(left)>(left, 0, INT_MAX));
-    }
-    return poll(&entry, 1, ms) != 0;
-}
-
-enum class session_direction {
-    none, /* a handshake: whatever it wants, nobody else is at it */
-    reads,
-    writes,
-};
-
-/* Runs a library call on the session until it has a result above 0, the session has ended or the time has come. */
-template <typename Call>
-int run(SSL *session, session_direction direction, clock_type::time_point end, const Call &call)
-{
-    for (;;) {
-        int result = 0;
-        int wanted = SSL_ERROR_NONE;
-        {
-            const log_lock hold{extra_of(session)->lock};
-            g_tls.ERR_clear_error();
-            errno = 0;
-            result = call();
-            wanted = result > 0 ? SSL_ERROR_NONE : g_tls.SSL_get_error(session, result);
-        }
-        if (result > 0)
-            return result;
-        if (wanted != SSL_ERROR_WANT_READ && wanted != SSL_ERROR_WANT_WRITE)
-            return wanted == SSL_ERROR_ZERO_RETURN ? 0 : -1;
-        const bool to_read = wanted == SSL_ERROR_WANT_READ;
-        const bool crossed = direction == (to_read ? session_direction::writes : session_direction::reads);
-        const bool ready = wait_for(g_tls.SSL_get_fd(session), to_read ? POLLIN : POLLOUT,
-                                    crossed ? clock_type::now() + kLookAgain : end);
-        if (!ready && !crossed) {
-            errno = ETIMEDOUT;
-            return -1;
-        }
-    }
-}
-
-/* As SSL_read(), but it waits: 0 at the session's end, -1 on failure. */
-int read_session(SSL *session, void *bytes, int len)
-{
-    const int n = run(session, session_direction::reads, kForEver, [&] { return g_tls.SSL_read(session, bytes, len); });
-    if (n == -1 && (errno == 0 || errno == EINTR))
-        errno = EPROTO; /* it is the session that has failed, not the read */
-    return n;
-}
-
-/* As SSL_write(), but it waits. */
-int write_session(SSL *session, const void *bytes, int len)
-{
-    return run(session, session_direction::writes, kForEver, [&] { return g_tls.SSL_write(session, bytes, len); });
-}
 
 /* Logs a name of the certificate as one line. */
 void log_name(const char *what, const X509_NAME *name)
@@ -147,40 +58,23 @@ bool load_files(SSL_CTX *context)
     return false;
 }
 
-/* A session that nobody uses yet; null without a context or memory. */
-SSL *new_session()
+/* A session on the socket; null without a context or memory. */
+SSL *new_session(int fd)
 {
-    std::unique_ptr<session_extra> extra{new (std::nothrow) session_extra};
-    SSL *session = nullptr;
-    {
-        const log_lock hold{g_context_lock};
-        if (g_ssl_ctx != nullptr && extra)
-            session = g_tls.SSL_new(g_ssl_ctx);
-    }
-    if (session != nullptr)
-        g_tls.SSL_set_ex_data(session, 0, extra.release());
-    return session;
+    const log_lock hold{g_context_lock};
+    return g_ssl_ctx != nullptr ? tls_session_new(g_ssl_ctx, fd) : nullptr;
 }
 
 /* A session on the socket that has shaken hands with the server; null when it has not (logged). */
 SSL *shake_hands(int fd)
 {
-    SSL *const session = new_session();
-    bool done = false;
     errno = 0;
-    if (session != nullptr) {
-        fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
-        g_tls.SSL_set_fd(session, fd);
-        done = run(session, session_direction::none, clock_type::now() + kHandshakeMax,
-                   [session] { return g_tls.SSL_connect(session); }) == 1;
-    }
-    if (done)
+    SSL *const session = new_session(fd);
+    if (session != nullptr && tls_session_connect(session, tls_clock::now() + kHandshakeMax))
         return session;
     const int error = errno;
-    if (session != nullptr) {
-        g_tls.SSL_shutdown(session);
-        free_session(session);
-    }
+    if (session != nullptr)
+        tls_session_free(session);
     LOG_FAULT("%s: SSL connect error %s errno: %d\n", "vex_open_ssl", std::strerror(error), error);
     return nullptr;
 }
@@ -190,8 +84,8 @@ SSL *shake_hands(int fd)
 log_tls_result log_tls_start()
 {
     g_daemon.use_ssl = 1;
-    g_daemon.ssl_read = read_session;
-    g_daemon.ssl_write = write_session;
+    g_daemon.ssl_read = tls_session_read;
+    g_daemon.ssl_write = tls_session_write;
     g_daemon.close_ssl = vex_close_ssl;
     if (!tls_library_load())
         return log_tls_result::no_context;
@@ -199,12 +93,14 @@ log_tls_result log_tls_start()
     g_tls.OPENSSL_init_crypto(OPENSSL_INIT_ADD_ALL_CIPHERS | OPENSSL_INIT_ADD_ALL_DIGESTS, nullptr);
     g_tls.OPENSSL_init_ssl(OPENSSL_INIT_LOAD_SSL_STRINGS | OPENSSL_INIT_LOAD_CRYPTO_STRINGS, nullptr);
     SSL_CTX *const context = g_tls.SSL_CTX_new(g_tls.TLS_client_method());
-    if (context == nullptr) {
+    if (context == nullptr || !tls_session_prepare()) {
         LOG_FAULT("**SOCKET: Create SSL_CTX error...\n");
         g_tls.ERR_print_errors_fp(stderr);
         return log_tls_result::no_context;
     }
     g_tls.SSL_CTX_set_verify(context, SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
+    /* A TLS 1.2 server may not begin anew: a write of one thread would have to take part in what another reads. */
+    g_tls.SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION);
     if (!load_files(context)) {
         g_tls.SSL_CTX_free(context);
         return log_tls_result::bad_files;
@@ -223,8 +119,7 @@ int vex_open_ssl(int fd, SSL **session)
         return 0;
     LOG_NOTE("Connected with %s encryption!!!", g_tls.SSL_CIPHER_get_name(g_tls.SSL_get_current_cipher(*session)));
     if (log_cert_check(*session) == 0) {
-        g_tls.SSL_shutdown(*session);
-        free_session(*session);
+        tls_session_free(*session);
         *session = nullptr;
         return 0;
     }
@@ -264,8 +159,7 @@ void vex_close_ssl(SSL *session, int free_context)
     if (g_daemon.use_ssl != 1)
         return;
     if (session != nullptr) {
-        g_tls.SSL_shutdown(session);
-        free_session(session);
+        tls_session_free(session);
         LOG_NOTE("**SOCKET: server_ssl free return\n");
     }
     if (free_context != 1)

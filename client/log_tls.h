@@ -1,10 +1,6 @@
 /*
  * TLS towards the log server: the context that all links share, one session for each link, and the check of the server's
  * certificate. Log lines bear the source "vex_log_manage".
- *
- * A session is read by one thread and written by others. Its socket is non-blocking; a lock of its own is held across
- * one library call at a time, and waiting is done without it, so that a reader who waits never holds up a writer. Who
- * owns the link closes the session, when nobody else can be using it any more.
  */
 #ifndef CLIENT_LOG_TLS_H
 #define CLIENT_LOG_TLS_H

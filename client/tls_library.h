@@ -11,12 +11,14 @@
 /* clang-format off */
 #define VEX_TLS_CALLS(X)                                                                                               \
     X(OPENSSL_init_ssl) X(OPENSSL_init_crypto) X(TLS_client_method) X(SSL_CTX_new) X(SSL_CTX_set_verify)               \
-    X(SSL_CTX_load_verify_locations) X(SSL_CTX_set_default_verify_paths) X(SSL_CTX_use_certificate_file)               \
-    X(SSL_CTX_use_PrivateKey_file) X(SSL_CTX_check_private_key) X(SSL_CTX_free) X(SSL_new) X(SSL_set_fd)               \
-    X(SSL_get_fd) X(SSL_connect) X(SSL_read) X(SSL_write) X(SSL_get_error) X(SSL_shutdown) X(SSL_free)                 \
-    X(SSL_set_ex_data) X(SSL_get_ex_data) X(SSL_get_current_cipher) X(SSL_CIPHER_get_name) X(SSL_get_verify_result)    \
-    X(SSL_get_peer_certificate) X(X509_get_subject_name) X(X509_get_issuer_name) X(X509_NAME_get_text_by_NID)          \
-    X(X509_NAME_oneline) X(X509_free) X(CRYPTO_free) X(ERR_clear_error) X(ERR_print_errors_fp)
+    X(SSL_CTX_set_options) X(SSL_CTX_load_verify_locations) X(SSL_CTX_set_default_verify_paths)                        \
+    X(SSL_CTX_use_certificate_file) X(SSL_CTX_use_PrivateKey_file) X(SSL_CTX_check_private_key) X(SSL_CTX_free)        \
+    X(SSL_new) X(SSL_set_rfd) X(SSL_set0_wbio) X(SSL_set_ex_data) X(SSL_get_ex_data) X(SSL_connect) X(SSL_read)        \
+    X(SSL_write) X(SSL_get_error) X(SSL_shutdown) X(SSL_free) X(SSL_get_current_cipher) X(SSL_CIPHER_get_name)         \
+    X(SSL_get_verify_result) X(SSL_get_peer_certificate) X(X509_get_subject_name) X(X509_get_issuer_name)              \
+    X(X509_NAME_get_text_by_NID) X(X509_NAME_oneline) X(X509_free) X(CRYPTO_free) X(ERR_clear_error)                   \
+    X(ERR_print_errors_fp) X(BIO_get_new_index) X(BIO_meth_new) X(BIO_meth_set_write) X(BIO_meth_set_ctrl)             \
+    X(BIO_new) X(BIO_free) X(BIO_set_data) X(BIO_get_data) X(BIO_set_init)
 /* clang-format on */
 
 /* The library's calls under their own names. */

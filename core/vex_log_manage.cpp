@@ -102,6 +102,6 @@ int main(int argc, char **argv)
     else if (const int status = run_client_mode(); status != 0)
         return status;
     wait_for_exit();
-    std::fflush(nullptr);
+    std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
     _exit(0); /* other threads still run: nothing that they use may be torn down */
 }
