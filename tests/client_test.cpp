@@ -1,4 +1,5 @@
 #include "tests/daemon.h"
+#include "tests/frame.h"
 
 #include <fstream>
 
@@ -123,8 +124,26 @@ TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
     }
 }
 
+TEST_F(Client, AnswersWhatItIsAskedDuringATransfer)
+{
+    run_command("head -c 5000000 /dev/urandom >/logfs/noise");
+    std::string commands = frame(R"({"msgid":"2"})");
+    for (int i = 0; i < 200; ++i)
+        commands += frame(kAskMode);
+    std::ofstream("/tmp/commands") << commands;
+    start_server("{ cat /tmp/commands; until [ $(grep -ao 'online\",\"Result' /tmp/said | wc -l) = 200 ]; do "
+                 "sleep 0.01; done; } | openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/server.crt "
+                 "-key /tmp/c/server.key -Verify 1 -verify_return_error -CAfile /tmp/c/ca.crt 2>/dev/null");
+    daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+    server_status();
+    EXPECT_EQ(0, daemon.wait_exit());
+    EXPECT_LT(5000000U, server_said().size());
+}
+
 TEST_F(Client, EndsWithItsServerWheneverThatIs)
 {
+    const std::string refuses = "sleep 9 | timeout 1 openssl s_server -accept 5000 -cert /tmp/c/server.crt -key "
+                                "/tmp/c/server.key -Verify 1 -verify_return_error -CAfile /tmp/c/server.crt ";
     const struct {
         std::string server;
         const char *tls_off;
@@ -132,10 +151,17 @@ TEST_F(Client, EndsWithItsServerWheneverThatIs)
     } cases[] = {
         {"true | busybox nc -l -p 5000 -w 1", "0", "vex_open_ssl: SSL connect error "},
         {"echo 'no TLS' | busybox nc -l -p 5000", "0", "vex_open_ssl: SSL connect error "},
-        {"true | vex_log_tool serve --listen 5000" + kTls, "0", "recv"},
+        {refuses + "-tls1_2", "0", "vex_open_ssl: SSL connect error "},
+        {refuses + "-tls1_3", "0", "recvfrom error,errno msg="},
+        {"until grep -q calls /tmp/said; do sleep 0.01; done | vex_log_tool serve --listen 5000" + kTls, "0",
+         "recvcount=0,client close"},
+        {"head -c 9000000 /dev/zero >/logfs/zero; printf 'archive /tmp/f/x\n' | vex_log_tool serve --listen 5000" +
+             kTls,
+         "0", "recvcount=0,client close"},
         {"printf '#~\\0\\0\\0\\036{\"msgid' | timeout 1 busybox nc -l -p 5000", "1", "recv data len =13"},
         {"printf 'archive /dev/full/x\\n' | vex_log_tool serve --listen 5000 --plain", "1", "recvcount=0,client close"},
     };
+    run_command("mkdir /tmp/f && mount -t tmpfs -o size=100k none /tmp/f"); /* full before an archive has come */
     for (const auto &c : cases) {
         set_nv("log_use_ssl_disable", c.tls_off);
         start_server(c.server);

@@ -68,6 +68,13 @@ fetch_result failed(int status, const std::string &why)
     return {status, why, "", false};
 }
 
+/* The same where the device may still be sending pieces, which would be taken for its next answer. */
+fetch_result broken_off(tool_device &device, int status, const std::string &why)
+{
+    device.link.reset();
+    return failed(status, why);
+}
+
 /* The length that a piece announces; 0 where it is none: a device counts in 32 bits. */
 std::uint64_t total_of(const tool_answer &answer)
 {
@@ -88,7 +95,7 @@ fetch_result receive_pieces(tool_device &device, const part_file &out)
         const auto limit = received == 0 ? device.limits.reply : device.limits.stall;
         const std::optional<tool_frame> frame = tool_receive(*device.link, limit, why);
         if (!frame)
-            return failed(kNoAnswer, why);
+            return broken_off(device, kNoAnswer, why);
         const tool_answer answer = tool_read_answer(frame->control, kMsgid);
         if (answer.verdict != tool_verdict::success)
             return {kDeviceSaidNo, tool_said(device, answer), frame->control,
@@ -101,10 +108,11 @@ fetch_result receive_pieces(tool_device &device, const part_file &out)
         }
         received += frame->data.size();
         if (announced != total || frame->data.empty() || received > total)
-            return failed(kDeviceSaidNo, "the pieces of the archive that " + device.link->where +
-                                             " sent do not fit together. Try again");
+            return broken_off(device, kDeviceSaidNo,
+                              "the pieces of the archive that " + device.link->where +
+                                  " sent do not fit together. Try again");
         if (!tool_write_whole(out.fd(), frame->data.data(), frame->data.size()))
-            return failed(kNoAnswer, out.cannot_store());
+            return broken_off(device, kNoAnswer, out.cannot_store());
         progress->advance(frame->data.size());
         if (received == total)
             return {kDone, "", frame->control, false};
@@ -118,7 +126,7 @@ fetch_result fetch(tool_device &device, const std::string &file, std::string &co
     if (!out.opened())
         return failed(kNoAnswer, out.cannot_store());
     if (!tool_send(*device.link, tool_command(kMsgid, nullptr, {{"GetLocalLog", ""}}), {}, why))
-        return failed(kNoAnswer, why);
+        return broken_off(device, kNoAnswer, why);
     if (isatty(STDERR_FILENO) == 1)
         std::fprintf(stderr, "The device packs its logs...\n");
     fetch_result result = receive_pieces(device, out);

@@ -13,7 +13,7 @@ int tool_fail(int status, const std::string &why)
 
 bool tool_reach(tool_device &device, std::string &why)
 {
-    if (!device.link && device.called)
+    if (!device.link && device.called_at != nullptr)
         why = "the device has hung up";
     else if (!device.link)
         device.link =
@@ -42,6 +42,10 @@ std::optional<tool_answer> tool_exchange(tool_device &device, const std::string 
     if (command.size() > kPkgControlMax) {
         why = "the command has " + std::to_string(command.size()) + " characters; " + std::to_string(kPkgControlMax) +
               " is the most";
+        return std::nullopt;
+    }
+    if (tool_interrupted()) { /* else the command would still go out, as a send need not wait */
+        why = "interrupted";
         return std::nullopt;
     }
     if (!tool_reach(device, why))

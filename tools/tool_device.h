@@ -8,6 +8,7 @@
 
 #include "tools/tool_answer.h"
 #include "tools/tool_link.h"
+#include "tools/tool_listener.h"
 
 #include <initializer_list>
 #include <utility>
@@ -21,9 +22,9 @@ struct tool_device {
     std::string host = "192.168.0.1";
     std::string port = "48888";
     tool_limits limits;
-    bool json = false;             /* print replies as they came instead of words */
-    bool called = false;           /* it has called us, and cannot be reached in another way */
-    std::optional<tool_link> link; /* once it was reached, until it fails */
+    bool json = false;                        /* print replies as they came instead of words */
+    const tool_listener *called_at = nullptr; /* it has called us there, and cannot be reached in another way */
+    std::optional<tool_link> link;            /* once it was reached, until it fails */
 };
 
 /* Says what failed; the status. */

@@ -11,6 +11,7 @@
 #include <netdb.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
+#include <openssl/err.h>
 #include <sys/socket.h>
 
 namespace
@@ -57,8 +58,24 @@ unique_fd connect_one(const addrinfo &address, tool_clock::time_point end, std::
 std::string ended(const tool_link &link, const std::string &how)
 {
     return "the connection to " + link.where + " ended before the answer was there: " + how +
-           ". The device serves one log tool at a time, so another one may have taken it over; if not, try again and "
-           "look at the device's own log";
+           (link.called
+                ? ". A device whose link has ended starts its log daemon anew and calls again; why it ended is in "
+                  "the device's own log"
+                : ". The device serves one log tool at a time, so another one may have taken it over; if not, "
+                  "try again and look at the device's own log");
+}
+
+/* What to say of a device that sent nothing for so long. */
+std::string silent(const tool_link &link, std::chrono::milliseconds limit, bool answer)
+{
+    const std::string fact = link.where + " sent nothing for " + tool_seconds(limit);
+    if (answer)
+        return fact +
+               ". Either it is still at work, then try again with a larger --reply-timeout, or it does not know the "
+               "command: such a one it leaves unanswered";
+    if (link.held.empty() && limit != link.limits.stall)
+        return fact;
+    return fact + " in the middle of an answer. Try again, or with a larger --stall-timeout";
 }
 
 /* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are none. */
@@ -99,6 +116,7 @@ ssize_t read_link(const tool_link &link, std::span<unsigned char> bytes, short &
     wanted = POLLIN;
     if (!link.session)
         return recv(link.fd.get(), bytes.data(), bytes.size(), 0);
+    ERR_clear_error();
     errno = 0;
     const int n = SSL_read(link.session.get(), bytes.data(), static_cast<int>(bytes.size()));
     return tool_tls_result(link.session.get(), n, wanted);
@@ -110,6 +128,7 @@ ssize_t write_link(const tool_link &link, std::span<const unsigned char> bytes, 
     wanted = POLLOUT;
     if (!link.session)
         return send(link.fd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
+    ERR_clear_error();
     errno = 0;
     const int n = SSL_write(link.session.get(), bytes.data(), static_cast<int>(bytes.size()));
     return tool_tls_result(link.session.get(), n, wanted);
@@ -136,12 +155,7 @@ bool receive_some(tool_link &link, std::chrono::milliseconds first, std::string 
         std::string interrupt;
         if (wait_ready(link.fd.get(), wanted, end, interrupt))
             continue;
-        why = !interrupt.empty()
-                  ? interrupt
-                  : link.where + " sent nothing for " + tool_seconds(limit) +
-                        (answer ? ". Either it is still at work, then try again with a larger --reply-timeout, or it "
-                                  "does not know the command: such a one it leaves unanswered"
-                                : " in the middle of an answer. Try again, or with a larger --stall-timeout");
+        why = !interrupt.empty() ? interrupt : silent(link, limit, answer);
         return false;
     }
 }
@@ -177,6 +191,23 @@ std::optional<tool_link> tool_connect(const std::string &host, const std::string
     }
     why = error == kInterrupted ? error : "cannot connect to " + where + ": " + error + advice;
     return std::nullopt;
+}
+
+std::string tool_address(int fd, decltype(getsockname) *end)
+{
+    sockaddr_storage address{};
+    socklen_t len = sizeof address;
+    char host[NI_MAXHOST] = {};
+    end(fd, reinterpret_cast<sockaddr *>(&address), &len);
+    getnameinfo(reinterpret_cast<const sockaddr *>(&address), len, host, sizeof host, nullptr, 0, NI_NUMERICHOST);
+    const std::string text = host;
+    return text.starts_with("::ffff:") ? text.substr(7) : text;
+}
+
+tool_link tool_called_link(unique_fd fd, const tool_limits &limits)
+{
+    std::string where = tool_address(fd.get(), getpeername);
+    return {.fd = std::move(fd), .where = std::move(where), .called = true, .limits = limits, .held = {}};
 }
 
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why)
@@ -220,9 +251,17 @@ std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::millisecond
         }
         std::optional<tool_frame> frame = len ? take_frame(link, *len) : std::nullopt;
         if (!frame)
-            why = "what " + link.where + " sent is not a frame. Is it a device's log daemon that listens there?";
+            why = "what " + link.where + " sent is not a frame. Is it a device's log daemon that " +
+                  (link.called ? "calls?" : "listens there?");
         else
             tool_log_frame("received", frame->control, frame->data.size());
         return frame;
     }
+}
+
+bool tool_still_there(tool_link &link)
+{
+    unsigned char byte = 0;
+    short wanted = 0;
+    return read_link(link, {&byte, 1}, wanted) < 0 && (errno == EAGAIN || errno == EINTR);
 }

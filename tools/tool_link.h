@@ -16,6 +16,7 @@
 #include <optional>
 #include <span>
 #include <string>
+#include <sys/socket.h>
 #include <vector>
 
 struct tool_limits {
@@ -28,6 +29,7 @@ struct tool_link {
     unique_fd fd;
     tls_session session = nullptr; /* over TLS; ends before its socket */
     std::string where;             /* the device's address and port, for messages */
+    bool called = false;           /* it was the device that made the connection */
     tool_limits limits;
     std::vector<unsigned char> held;                            /* received bytes behind the frames that were taken */
     std::unique_ptr<log_msg> msg = std::make_unique<log_msg>(); /* the frame being sent, or taken last */
@@ -42,11 +44,21 @@ struct tool_frame {
 std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
                                       const char *advice, std::string &why);
 
+/* The address of an end of a connection, getsockname or getpeername; of an IPv4 one as such, whatever the socket. */
+std::string tool_address(int fd, decltype(getsockname) *end);
+
+/* The link that a device has made to us, on its accepted, non-blocking socket. */
+tool_link tool_called_link(unique_fd fd, const tool_limits &limits);
+
 /* Sends one frame. */
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why);
 
 /* Waits for the next frame, `first` for its first byte: link.limits.reply for an answer, link.limits.stall inside a
  * transfer. */
 std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why);
+
+/* Whether the device still keeps the connection, when its socket is readable: a device says nothing unasked, but its TLS
+ * may. */
+bool tool_still_there(tool_link &link);
 
 #endif

@@ -242,7 +242,7 @@ int stop_only(tool_device &device, const std::string &log)
 
 int tool_stream(tool_device &device, const tool_stream_options &options)
 {
-    if (device.called)
+    if (device.called_at != nullptr)
         return tool_fail(kNoAnswer, "a device that has called streams over links of its own, which are not taken yet");
     if (options.stop)
         return stop_only(device, options.log);

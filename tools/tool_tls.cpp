@@ -6,13 +6,25 @@
 namespace
 {
 
-/* What the library found wrong first. */
-std::string first_error()
+/* What the library found wrong last. */
+std::string last_error()
 {
-    char text[256] = "the peer has hung up";
-    if (const unsigned long error = ERR_get_error(); error != 0)
-        ERR_error_string_n(error, text, sizeof text);
+    const char *const reason = ERR_reason_error_string(ERR_peek_last_error());
+    const std::string text = reason != nullptr ? reason : "the peer has hung up";
     ERR_clear_error();
+    return text;
+}
+
+/* Why there is no session with a caller. */
+std::string handshake_error(const SSL *session)
+{
+    if (const long verified = SSL_get_verify_result(session); verified != X509_V_OK)
+        return std::string("its certificate is not accepted: ") + X509_verify_cert_error_string(verified) +
+               ". Is it signed by --ca?";
+    const int reason = ERR_GET_REASON(ERR_peek_last_error());
+    std::string text = "TLS handshake failed: " + last_error();
+    if (reason == SSL_R_WRONG_VERSION_NUMBER || reason == SSL_R_HTTP_REQUEST)
+        text += ". It does not seem to speak TLS; for a device without, there is --plain";
     return text;
 }
 
@@ -21,6 +33,10 @@ std::string first_error()
 tls_context tool_tls_server(const std::string &cert, const std::string &key, const std::string &ca, std::string &why)
 {
     tls_context context{SSL_CTX_new(TLS_server_method())};
+    if (!context) {
+        why = "cannot begin with TLS: " + last_error();
+        return nullptr;
+    }
     SSL_CTX_set_verify(context.get(), SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
     SSL_CTX_set_min_proto_version(context.get(), TLS1_2_VERSION);
     if (SSL_CTX_use_certificate_chain_file(context.get(), cert.c_str()) != 1)
@@ -32,23 +48,30 @@ tls_context tool_tls_server(const std::string &cert, const std::string &key, con
         why = "cannot use the CA certificate " + ca;
     else
         return context;
-    why += ": " + first_error();
+    why += ": " + last_error();
     return nullptr;
 }
 
 tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why)
 {
     tls_session session{SSL_new(context)};
-    SSL_set_fd(session.get(), fd);
+    if (!session || SSL_set_fd(session.get(), fd) != 1) {
+        why = "TLS handshake failed: " + last_error();
+        return nullptr;
+    }
     for (;;) {
+        ERR_clear_error();
+        errno = 0;
         short wanted = 0;
         if (tool_tls_result(session.get(), SSL_accept(session.get()), wanted) > 0)
             return session;
         pollfd entry{fd, wanted, 0};
         if (wanted == 0)
-            why = "TLS handshake failed: " + first_error();
+            why = handshake_error(session.get());
         else if (const tool_wait event = tool_wait_for({&entry, 1}, end); event != tool_wait::ready)
-            why = event == tool_wait::interrupted ? "interrupted" : "TLS handshake failed: the time has come";
+            why = event == tool_wait::interrupted
+                      ? "interrupted"
+                      : "TLS handshake failed: it did not go on for the time of --connect-timeout";
         else
             continue;
         return nullptr;

@@ -13,7 +13,11 @@ struct tls_context_deleter {
     void operator()(SSL_CTX *context) const { SSL_CTX_free(context); }
 };
 struct tls_session_deleter {
-    void operator()(SSL *session) const { SSL_free(session); }
+    void operator()(SSL *session) const
+    {
+        SSL_shutdown(session); /* says good-bye, as far as the socket takes it at once */
+        SSL_free(session);
+    }
 };
 
 using tls_context = std::unique_ptr<SSL_CTX, tls_context_deleter>;

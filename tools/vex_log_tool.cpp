@@ -38,15 +38,21 @@ void add_limit(CLI::App &app, const char *name, std::chrono::milliseconds &limit
         ->default_str(limit.count() > 0 ? std::to_string(limit.count() / 1000) : "");
 }
 
-void add_common_options(CLI::App &app, tool_device &device)
+/* The options of every command, whoever made the connection. */
+void add_output_options(CLI::App &app, tool_device &device)
 {
-    app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
-    app.add_option("--port", device.port, "port of its log daemon")->check(CLI::Range(1, 65535))->capture_default_str();
     app.add_flag("--json", device.json, "print the device's reply as it came");
     app.add_flag_callback("--debug", tool_log_show, "show on standard error what goes over the wire");
     add_limit(app, "--connect-timeout", device.limits.connect, "longest wait for a connection");
     add_limit(app, "--reply-timeout", device.limits.reply, "longest wait for an answer");
     add_limit(app, "--stall-timeout", device.limits.stall, "longest pause inside a transfer");
+}
+
+void add_common_options(CLI::App &app, tool_device &device)
+{
+    app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
+    app.add_option("--port", device.port, "port of its log daemon")->check(CLI::Range(1, 65535))->capture_default_str();
+    add_output_options(app, device);
 }
 
 /* What the command line says beside the command. */
@@ -130,19 +136,32 @@ void add_commands(CLI::App &app, tool_words &words, tool_job &job)
     add_transfers(app, words, job);
 }
 
-/* Runs a command line for a device that has called. */
+/* Runs a command line for a device that has called. What it says of output and limits holds for itself only. */
 int run_line(tool_device &device, const std::string &line)
 {
+    if (line.starts_with("raw {")) /* JSON as it is: quotes and blanks are its own */
+        return tool_raw(device, line.substr(4));
+    const bool json = device.json;
+    const tool_limits limits = device.limits;
     tool_words words;
     tool_job job;
     CLI::App app{"Commands for the device that has called."};
+    app.fallthrough();
+    add_output_options(app, device);
     add_commands(app, words, job);
+    int status = 0;
     try {
         app.parse(line);
+        device.link->limits = device.limits;
+        status = job(device);
     } catch (const CLI::ParseError &error) {
-        return app.exit(error);
+        if (error.get_exit_code() != 0)
+            std::fprintf(stderr, "%s:\n", line.c_str());
+        status = app.exit(error);
     }
-    return job(device);
+    device.json = json;
+    device.limits = limits;
+    return status;
 }
 
 void add_serve(CLI::App &app, tool_serve_options &options, tool_job &job)
@@ -158,7 +177,12 @@ void add_serve(CLI::App &app, tool_serve_options &options, tool_job &job)
     add_file("--cert", options.cert, "our certificate, a PEM file");
     add_file("--key", options.key, "its key");
     add_file("--ca", options.ca, "certificate that the devices' are signed by");
-    serve->callback([&] { job = [&](tool_device &device) { return tool_serve(device, options, run_line); }; });
+    serve->callback([&] {
+        if (app.count("--host") + app.count("--port") > 0)
+            throw CLI::ValidationError(
+                "serve is called by devices, at the port of --listen; it has no --host or --port");
+        job = [&](tool_device &device) { return tool_serve(device, options, run_line); };
+    });
 }
 
 } // namespace
