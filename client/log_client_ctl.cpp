@@ -1,6 +1,7 @@
 #include "client/log_client_ctl.h"
 
 #include "client/log_connect.h"
+#include "client/log_identity.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
@@ -19,21 +20,14 @@ constexpr char kLogSource[] = "vex_log_manage";
 /* Tells the server which device calls. Whether it hears it shows by what it does next. */
 void announce(int fd, SSL *session)
 {
-    char version[64] = {};
-    char model[64] = {};
-    char imei[64] = {};
-    char msn[64] = {};
-    vex_get_nv_item("integrate_version", version, sizeof version);
-    vex_get_nv_item("model_name", model, sizeof model);
-    vex_get_nv_item("imei", imei, sizeof imei);
-    vex_get_nv_item("modem_msn", msn, sizeof msn);
+    const log_identity device = log_read_identity();
     char text[1024];
     std::snprintf(text, sizeof text,
                   "{\"msgid\":\"9\",\"ControlLink\":{\"VersionInfo\":\"%s\",\"projectName\":\"%s\",\"imei\":\"%s\","
                   "\"modem_msn\":\"%s\"},\"Result\":\"\"}",
-                  version, model, imei, msn);
+                  device.version, device.model, device.imei, device.msn);
     LOG_NOTE("%s:%s\n", "log_client_ctl_thread_proc", text);
-    log_send_pkg_msg(fd, session, text, "", 0);
+    log_send_pkg_msg(fd, session, text, "", 0); /* nobody else knows the link yet */
 }
 
 /* Serves the link until it ends; then it is closed. */

@@ -154,16 +154,13 @@ log_cmd_use::~log_cmd_use()
     g_sending_fd = -1;
 }
 
-log_cmd_turn::log_cmd_turn()
+log_cmd_turn::log_cmd_turn(bool beside_others)
 {
-    if (t_served_fd == -1) {
-        granted_ = true;
-        return;
-    }
     const log_lock hold{g_registry_lock};
-    while (g_turn_taken && stands())
+    while (!beside_others && g_turn_taken && stands())
         g_registry_lock.wait(g_turn_change);
-    granted_ = taken_ = stands();
+    granted_ = stands();
+    taken_ = granted_ && !beside_others;
     if (taken_)
         g_turn_taken = true;
 }

@@ -10,6 +10,8 @@
  * The locks of the daemon, in the order in which one may be taken while another is held:
  *
  *   g_takeover_lock  one accepted connection at a time takes the place of another
+ *   producer_lock    of a stream: one thread at a time deals with its log program (core/log_streams.h), and
+ *   send_lock        of a stream: one send at a time on its data link
  *   g_cmd_send_lock  one frame at a time on the command connection: held while it is sent (log_cmd_use)
  *   g_registry_lock  the fields of the registry. Held for a few instructions: no waiting for a peer, sending, logging
  *                    or starting of threads and programs
@@ -93,14 +95,14 @@ bool log_cmd_stands();
 void log_cmd_close(int fd);
 
 /*
- * A turn to run a command. One tool's thread has it at a time: a tool that took another's place waits here until the
- * other's command has ended. A thread whose connection is taken away meanwhile waits no longer; it gets no turn. A
- * thread that owns no command connection runs its commands whenever they come.
+ * A turn to run a command. One thread has it at a time: a tool that took another's place waits here until the other's
+ * command has ended, and a data link for the control link. A thread whose connection is taken away meanwhile waits no
+ * longer; it gets no turn. A command that may run beside others gets its turn at once.
  */
 class log_cmd_turn
 {
 public:
-    log_cmd_turn();
+    explicit log_cmd_turn(bool beside_others);
     ~log_cmd_turn();
     log_cmd_turn(const log_cmd_turn &) = delete;
     log_cmd_turn &operator=(const log_cmd_turn &) = delete;
@@ -108,7 +110,7 @@ public:
 
 private:
     bool granted_ = false;
-    bool taken_ = false; /* and is to be given back */
+    bool taken_ = false; /* and to be given back */
 };
 
 /* The command connection, held for one frame. fd() is -1 when there is none or this thread has lost its own. */

@@ -17,6 +17,7 @@
 #include <netinet/tcp.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 
 namespace
 {
@@ -46,6 +47,40 @@ int write_some(int fd, SSL *ssl, const char *bytes, int len)
     if (g_daemon.use_ssl == 1)
         return g_daemon.ssl_write(ssl, bytes, len);
     return static_cast<int>(send(fd, bytes, static_cast<std::size_t>(len), 0));
+}
+
+/* As system(), for a line whose program inherits a descriptor. */
+int run_shell_with(const char *cmdStr, int handed_fd)
+{
+    const pid_t shell = fork();
+    if (shell == 0) {
+        fcntl(handed_fd, F_SETFD, 0);
+        execl("/bin/sh", "sh", "-c", cmdStr, nullptr);
+        _exit(127);
+    }
+    int status = -1;
+    while (shell != -1 && waitpid(shell, &status, 0) == -1)
+        if (errno != EINTR)
+            return -1;
+    return status;
+}
+
+/* Logs what became of a shell line, and flushes file systems to storage; 0 when it exited with status 0, else -1. */
+int judge_cmd(const char *cmdStr, int status)
+{
+    int result = -1;
+    if (status == -1) {
+        LOG_FAULT("[%s] System error1\n", cmdStr);
+    } else if ((status & 0x7f) != 0) {
+        LOG_FAULT("[%s] System error2\n", cmdStr);
+    } else if (((status >> 8) & 0xff) != 0) {
+        LOG_FAULT("[%s] System error3\n", cmdStr);
+    } else {
+        LOG_NOTE("[%s] System ok\n", cmdStr);
+        result = 0;
+    }
+    sync();
+    return result;
 }
 
 } // namespace
@@ -118,20 +153,13 @@ int log_exec_cmd(const char *cmdStr)
     if (cmdStr == nullptr)
         return -1;
     LOG_NOTE("cmdStr[%s]\n", cmdStr);
-    const int status = std::system(cmdStr);
-    int result = -1;
-    if (status == -1) {
-        LOG_FAULT("[%s] System error1\n", cmdStr);
-    } else if ((status & 0x7f) != 0) {
-        LOG_FAULT("[%s] System error2\n", cmdStr);
-    } else if (((status >> 8) & 0xff) != 0) {
-        LOG_FAULT("[%s] System error3\n", cmdStr);
-    } else {
-        LOG_NOTE("[%s] System ok\n", cmdStr);
-        result = 0;
-    }
-    sync();
-    return result;
+    return judge_cmd(cmdStr, std::system(cmdStr));
+}
+
+int log_exec_cmd_with(const char *cmdStr, int handed_fd)
+{
+    LOG_NOTE("cmdStr[%s]\n", cmdStr);
+    return judge_cmd(cmdStr, run_shell_with(cmdStr, handed_fd));
 }
 
 int vex_popen(const char *cmd, char *buffer, int size)

@@ -48,6 +48,9 @@ int log_text_to_int(const char *text);
  * with status 0, else -1 (logged). A line that ends in "&" leaves its program running and yields 0 at once. */
 int log_exec_cmd(const char *cmdStr);
 
+/* The same for a line whose program is told a descriptor by its number: it alone inherits `handed_fd`. */
+int log_exec_cmd_with(const char *cmdStr, int handed_fd);
+
 /* Runs the shell command line and captures the first line of its output, without its newline and cut at size
  * - 1 characters, in `buffer` of `size` bytes, which is cleared first. 1 captured, 0 nothing to capture. */
 int vex_popen(const char *cmd, char *buffer, int size);

@@ -103,5 +103,5 @@ int main(int argc, char **argv)
         return status;
     wait_for_exit();
     std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
-    _exit(0); /* other threads still run: nothing that they use may be torn down */
+    _exit(0);            /* other threads still run: nothing that they use may be torn down */
 }

@@ -10,12 +10,14 @@
 #include "device/diag_record.h"
 #include "platform/unique_fd.h"
 
+#include <cerrno>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <netdb.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -33,12 +35,25 @@ struct options {
     const char *port = "";
 };
 
+/* Sends a record whole, also on a socket that does not block; false when the peer is gone. */
+bool send_record(int fd, const diag_record &record)
+{
+    for (std::size_t sent = 0; sent < record.size();) {
+        pollfd entry{fd, POLLOUT, 0};
+        poll(&entry, 1, -1);
+        const ssize_t n = send(fd, record.data() + sent, record.size() - sent, MSG_NOSIGNAL);
+        if (n < 0 && errno != EAGAIN)
+            return false;
+        sent += static_cast<std::size_t>(n > 0 ? n : 0);
+    }
+    return true;
+}
+
 /* Streams from the first record on until the peer is gone. */
 void stream(int fd)
 {
     for (std::uint32_t number = 0;; ++number) {
-        const diag_record record = make_diag_record(number);
-        if (send(fd, record.data(), record.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(record.size()))
+        if (!send_record(fd, make_diag_record(number)))
             return;
         usleep(kRecordInterval);
     }

@@ -35,6 +35,9 @@ int log_msg_clean_local_log(const char *control, const unsigned char *data, std:
 /* Message id 8: sets the log level of a kernel module, now and at every start, or tells the one that was set. */
 int log_msg_set_bsp_log(const char *control, const unsigned char *data, std::int32_t dataLen);
 
+/* Message id 10: the server's confirmation of a data link: has the stream's log program started. Not answered. */
+int log_msg_confirm_channel(const char *control, const unsigned char *data, std::int32_t dataLen);
+
 /* Message id 11: asks the modem's owner for low-power mode or online mode, or tells which is set. */
 int log_msg_mode_lpm_online(const char *control, const unsigned char *data, std::int32_t dataLen);
 

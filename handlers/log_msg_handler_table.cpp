@@ -10,7 +10,7 @@ const std::array<log_msg_handler_entry, 11> log_msg_handler_table{{
     {6, log_msg_set_realtime_log},
     {7, log_msg_clean_local_log},
     {8, log_msg_set_bsp_log},
-    {9, nullptr}, /* the number of the announcement that the daemon itself sends as a client */
-    {10, nullptr},
+    {9, nullptr},                        /* the number of the announcement that the daemon itself sends as a client */
+    {10, log_msg_confirm_channel, true}, /* a stream begins although the control link is busy with an archive */
     {11, log_msg_mode_lpm_online},
 }};

@@ -1,6 +1,7 @@
 #include "protocol/log_json_codec.h"
 
 #include "core/log_line.h"
+#include "core/log_registry.h"
 #include "core/log_tools.h"
 
 #include <algorithm>
@@ -88,6 +89,11 @@ int log_dl_msg_handle_cmd(const char *control, const unsigned char *data, std::i
     if (entry->handler == nullptr) {
         LOG_NOTE("%s,msgid %d hander is null\n", __func__, msgid);
         return 0;
+    }
+    const log_cmd_turn turn{entry->beside_others};
+    if (!turn.granted()) {
+        LOG_NOTE("%s: another tool has taken over, command dropped\n", __func__);
+        return -1;
     }
     t_dispatched = {control, &tree};
     entry->handler(control, data, dataLen);

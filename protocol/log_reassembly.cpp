@@ -1,7 +1,6 @@
 #include "protocol/log_reassembly.h"
 
 #include "core/log_line.h"
-#include "core/log_registry.h"
 #include "protocol/log_json_codec.h"
 
 #include <cstddef>
@@ -114,14 +113,7 @@ int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece
         LOG_NOTE("%s:A complete packet of data received  =%d", __func__, static_cast<int>(state.recv_pkg_len));
         if (log_FindTail_pkg(held + *len - kPkgTagLen, end) == nullptr)
             return 0;
-        {
-            const log_cmd_turn turn;
-            if (!turn.granted()) {
-                LOG_NOTE("%s: another tool has taken over, command dropped\n", __func__);
-                return 0;
-            }
-            handle_frame(*state.incoming, *len);
-        }
+        handle_frame(*state.incoming, *len);
         drop_frame(state, *len);
     }
     return 0;

@@ -36,10 +36,9 @@ struct log_reassembly {
 unsigned char *log_reassembly_room(log_reassembly &state);
 
 /*
- * Appends a piece, from log_reassembly_room() or from anywhere else, and handles every whole frame, in order, on the calling thread; a rest is kept for the next
- * piece. A frame that cannot be decoded is dropped by itself. Once the thread's command connection has been
- * taken over by another tool, no further command of it runs. 0; -1 only when the buffer cannot be allocated:
- * the piece is lost. Logs at level 6 as "vex_log_manage".
+ * Appends a piece, from log_reassembly_room() or from anywhere else, and handles every whole frame, in order, on the
+ * calling thread; a rest is kept for the next piece. A frame that cannot be decoded is dropped by itself. 0; -1 only when
+ * the buffer cannot be allocated: the piece is lost. Logs at level 6 as "vex_log_manage".
  */
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece);
 

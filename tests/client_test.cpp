@@ -47,7 +47,8 @@ TEST_F(Client, ServesTheServerThatItCalls)
                 "tar -cf /tmp/p.tar -C /tmp/p conf");
     for (const auto &c : cases) {
         set_nv("log_use_ssl_disable", c.tls_off);
-        start_server("printf 'version\\nbsp usb err\\narchive /tmp/a.tgz\\nmodem\\nconfig /tmp/p.tar\\n' | "
+        start_server("printf 'version\\nbsp usb err\\narchive /tmp/a.tgz\\nmodem\\nconfig /tmp/p.tar\\nstream qxdm "
+                     "--for 0.5 --output /tmp/modem.log\\n' | "
                      "vex_log_tool serve --listen 5000" +
                      c.options);
         daemon_process daemon({"-a", c.address, "-p", "5000x", "-r", "3"});
@@ -55,11 +56,13 @@ TEST_F(Client, ServesTheServerThatItCalls)
         EXPECT_EQ(0, daemon.wait_exit());
         const std::string said = server_said();
         for (const char *words : {c.calls, "IMEI              356938035643809\n", "usb: log level err: the device was",
-                                  "Log archive stored as", "set to: online\n", "taken the package of 10240 bytes"})
+                                  "Log archive stored as", "set to: online\n", "taken the package of 10240 bytes",
+                                  " kB of the log received."})
             EXPECT_NE(std::string::npos, said.find(words)) << c.name << ' ' << words << '\n' << said;
         EXPECT_EQ("", run_command("tar -xOzf /tmp/a.tgz logfs/noise | cmp - /logfs/noise")) << c.name;
+        EXPECT_EQ("DIAG", run_command("head -c 4 /tmp/modem.log; rm /tmp/modem.log"));
         EXPECT_EQ(1, daemon.logged("vex_log_manage exit "));
-        EXPECT_EQ(c.tls_off == std::string("1") ? 0 : 1, daemon.logged("very good ,log_server check ok "));
+        EXPECT_EQ(c.tls_off == std::string("1") ? 0 : 2, daemon.logged("very good ,log_server check ok "));
         EXPECT_EQ(0, daemon.logged("log_server_thread_proc"));
     }
 }

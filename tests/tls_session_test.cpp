@@ -86,7 +86,7 @@ TEST(TlsSession, IsReadAndWrittenWhileKeysChange)
     ASSERT_TRUE(tls_session_prepare());
     SSL_CTX *const ours = SSL_CTX_new(TLS_client_method());
     SSL_CTX *const theirs = server_context();
-    for (const std::size_t write_size : {2000, 51282}) {
+    for (const std::size_t write_size : {std::size_t{2000}, std::size_t{51282}}) {
         int ends[2];
         ASSERT_EQ(0, socketpair(AF_UNIX, SOCK_STREAM, 0, ends));
         const unique_fd fd{ends[0]};

@@ -1,5 +1,6 @@
 #include "tools/tool_answer.h"
 
+#include <algorithm>
 #include <utility>
 
 namespace
@@ -46,6 +47,19 @@ std::string tool_printable(const std::string &text)
         else
             out += c;
         last = byte;
+    }
+    return out;
+}
+
+std::string tool_printable_lines(const std::string &text)
+{
+    std::string out;
+    for (std::size_t at = 0; at < text.size();) {
+        const std::size_t end = std::min(text.find('\n', at), text.size());
+        out += tool_printable(text.substr(at, end - at));
+        if (end < text.size())
+            out += '\n';
+        at = end + 1;
     }
     return out;
 }

@@ -23,6 +23,9 @@ struct tool_answer {
 /* The text as a terminal may show it: control bytes, which could command the terminal, as \xNN. */
 std::string tool_printable(const std::string &text);
 
+/* The same for a text of several lines, whose ends are kept. */
+std::string tool_printable_lines(const std::string &text);
+
 /* The message id of a command or a reply; empty when it has none. */
 std::string tool_msgid(const std::string &control);
 

@@ -24,6 +24,7 @@ struct tool_device {
     tool_limits limits;
     bool json = false;                        /* print replies as they came instead of words */
     const tool_listener *called_at = nullptr; /* it has called us there, and cannot be reached in another way */
+    std::string imei;                         /* of the one that has called */
     std::optional<tool_link> link;            /* once it was reached, until it fails */
 };
 

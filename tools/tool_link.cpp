@@ -259,6 +259,16 @@ std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::millisecond
     }
 }
 
+ssize_t tool_read_some(tool_link &link, std::span<unsigned char> bytes, short &wanted)
+{
+    if (link.held.empty())
+        return read_link(link, bytes, wanted);
+    const std::size_t n = std::min(bytes.size(), link.held.size());
+    std::copy_n(link.held.begin(), n, bytes.begin());
+    link.held.erase(link.held.begin(), link.held.begin() + static_cast<std::ptrdiff_t>(n));
+    return static_cast<ssize_t>(n);
+}
+
 bool tool_still_there(tool_link &link)
 {
     unsigned char byte = 0;

@@ -75,6 +75,7 @@ bool await_device(tool_device &device, const tool_listener &listener, input_line
                     call->link.session ? " over TLS" : "", text("projectName").c_str(), text("VersionInfo").c_str(),
                     text("imei").c_str(), text("modem_msn").c_str());
         std::fflush(stdout);
+        device.imei = text("imei");
         device.link = std::move(call->link);
         return true;
     }
@@ -89,6 +90,7 @@ bool run_lines(tool_device &device, input_lines &input, const tool_run_line &run
         std::optional<std::string> line;
         while (device.link && !tool_interrupted() && (line = input.next())) {
             status = run_line(device, *line);
+            tool_catch_interrupts(); /* a stream that the user ended is no reason to end */
             std::fflush(stdout);
         }
         if (!device.link)

@@ -2,6 +2,7 @@
 
 #include "tools/tool_process.h"
 #include "tools/tool_progress.h"
+#include "tools/tool_stream_source.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -9,98 +10,27 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
-#include <netinet/in.h>
 #include <string_view>
-#include <sys/socket.h>
 #include <unistd.h>
 
 namespace
 {
 
-constexpr std::uint16_t kSyslogPort = 1514;
 constexpr auto kFirstBytes = std::chrono::seconds(10); /* then the user is told that nothing has come yet */
 constexpr auto kForEver = std::chrono::hours(24 * 365);
 
-/* Where a stream's bytes come from and go to. */
-struct stream_ends {
-    unique_fd in;
-    unique_fd out_file;
-    bool datagrams = false; /* each is a line without its end */
-    int out() const { return out_file ? out_file.get() : STDOUT_FILENO; }
-};
+/* Where a stream's bytes go to. */
+struct stream_output {
+    unique_fd file; /* none: standard output */
+    bool text = false;
 
-/* What was asked of the device, and what is still to come of it. */
-struct stream_start {
-    bool asked = false; /* then it is to be asked to stop, whatever happens */
-    bool answered = false;
-    int status = kNoAnswer;
-    std::string why; /* when there is no stream */
-};
-
-std::string stream_command(const std::string &log, const char *action)
-{
-    return tool_command("6", "realtimeLog", {{"LogType", log}, {"Action", action}});
-}
-
-/* An end of the connection to the device, with another port. */
-sockaddr_storage end_of(const tool_link &link, decltype(getsockname) *which, std::uint16_t port)
-{
-    sockaddr_storage address{};
-    socklen_t len = sizeof address;
-    which(link.fd.get(), reinterpret_cast<sockaddr *>(&address), &len);
-    /* The port is at the same place for both families. */
-    reinterpret_cast<sockaddr_in *>(&address)->sin_port = htons(port);
-    return address;
-}
-
-/* The socket that the device's system log will arrive at: on the address that the device knows this side by. */
-unique_fd open_syslog(const tool_link &link, std::string &why)
-{
-    const sockaddr_storage own = end_of(link, getsockname, kSyslogPort);
-    unique_fd sock{socket(own.ss_family, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
-    if (sock && bind(sock.get(), reinterpret_cast<const sockaddr *>(&own), sizeof own) == 0)
-        return sock;
-    why = "cannot receive on UDP port " + std::to_string(kSyslogPort) + ": " + std::strerror(errno) +
-          ". Is another program listening there?";
-    return {};
-}
-
-/* The connection that the modem's log comes by, to where the device's answer says. */
-unique_fd open_modem_log(const tool_device &device, const tool_answer &answer, std::string &why)
-{
-    const std::string ip = tool_answer_text(answer, "realtimeLog", "ip");
-    const std::string port = tool_answer_text(answer, "realtimeLog", "port");
-    std::optional<tool_link> link = tool_connect(
-        ip, port, device.limits, ". The device streams on its LAN address only: is this PC on its LAN?", why);
-    if (link)
-        return std::move(link->fd);
-    why = "the device says that it streams from " + ip + " port " + port + ", but " + why;
-    return {};
-}
-
-/* Has the device start, and opens the way that its answer names. */
-stream_start start(tool_device &device, const std::string &log, stream_ends &ends)
-{
-    stream_start state;
-    ends.datagrams = log == "syslog";
-    if (ends.datagrams && !(ends.in = open_syslog(*device.link, state.why)))
-        return state;
-    state.asked = true;
-    const std::optional<tool_answer> answer = tool_exchange(device, stream_command(log, "start"), {}, state.why);
-    state.answered = answer.has_value();
-    if (!answer)
-        return state;
-    if (device.json && answer->root) /* standard output may be where the log goes */
-        std::fprintf(ends.out_file ? stdout : stderr, "%s\n", answer->control.c_str());
-    if (answer->verdict != tool_verdict::success) {
-        state.asked = false;
-        state.status = kDeviceSaidNo;
-        state.why = tool_said(device, *answer);
-    } else if (!ends.datagrams) {
-        ends.in = open_modem_log(device, *answer, state.why);
+    int fd() const { return file ? file.get() : STDOUT_FILENO; }
+    /* On a terminal, the system log without what could command it. */
+    std::string shown(const std::string &bytes) const
+    {
+        return text && isatty(fd()) == 1 ? tool_printable_lines(bytes) : bytes;
     }
-    return state;
-}
+};
 
 /* Writes bytes as fast as they are taken; false, and why, when they are not, or the user wants to end. */
 bool write_patiently(int fd, std::string_view bytes, std::string &why)
@@ -119,121 +49,81 @@ bool write_patiently(int fd, std::string_view bytes, std::string &why)
     return true;
 }
 
-/* Whether a datagram comes from the device that was asked. */
-bool from_device(const tool_link &link, const sockaddr_storage &source)
-{
-    const sockaddr_storage device = end_of(link, getpeername, 0);
-    if (source.ss_family == AF_INET6)
-        return std::memcmp(&reinterpret_cast<const sockaddr_in6 &>(source).sin6_addr,
-                           &reinterpret_cast<const sockaddr_in6 &>(device).sin6_addr, sizeof(in6_addr)) == 0;
-    return reinterpret_cast<const sockaddr_in &>(source).sin_addr.s_addr ==
-           reinterpret_cast<const sockaddr_in &>(device).sin_addr.s_addr;
-}
-
-/* A line of the system log as it is to be written; on a terminal, without what could command it. */
-std::string line_of(std::string_view datagram, int out)
-{
-    std::string line(datagram.substr(0, datagram.find_last_not_of('\n') + 1));
-    if (isatty(out) == 1)
-        line = tool_printable(line);
-    return line + '\n';
-}
-
-/* Passes on what there is. Bytes received; 0 when there was nothing, -1 at the end of the stream, and why unless it was
- * the user's. */
-ssize_t pass_on(const tool_link &link, const stream_ends &ends, std::string &why)
-{
-    char piece[65536];
-    sockaddr_storage source{};
-    socklen_t len = sizeof source;
-    const ssize_t n = recvfrom(ends.in.get(), piece, sizeof piece, 0, reinterpret_cast<sockaddr *>(&source), &len);
-    if (n < 0 && (errno == EAGAIN || errno == EINTR || ends.datagrams))
-        return 0;
-    if (n <= 0 && !ends.datagrams) {
-        why = n == 0 ? "the device has ended the stream" : std::string("the stream broke: ") + std::strerror(errno);
-        return -1;
-    }
-    const std::string_view bytes(piece, static_cast<std::size_t>(n));
-    if (ends.datagrams && !from_device(link, source))
-        return 0;
-    return write_patiently(ends.out(), ends.datagrams ? line_of(bytes, ends.out()) : bytes, why) ? n : -1;
-}
-
-/* Whether the device has closed the connection, which it does only to a tool that it no longer serves. */
-bool lost(const tool_link &link)
-{
-    char byte = 0;
-    const ssize_t n = recv(link.fd.get(), &byte, 1, MSG_DONTWAIT);
-    return n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR);
-}
-
 /* How a stream ended. */
 struct stream_result {
     std::uint64_t bytes = 0;
+    bool over = false;        /* at its own end */
     bool device_lost = false; /* another tool has it, or it is gone */
     std::string why;          /* when it was not the user who ended it */
 };
 
-/* Until the user, the time, the device or the stream's own end ends it. */
-stream_result relay(const tool_link &link, const stream_ends &ends, tool_clock::time_point end)
+/* Why the device is lost. */
+std::string lost(const tool_link &link)
 {
-    stream_result result;
+    return "the connection to " + link.where + " ended. " +
+           (link.called
+                ? "Its log daemon ends with it, and the stream, too"
+                : "Another log tool may have taken it over; until one has it stop (stream LOG --stop), the device "
+                  "goes on streaming to this PC");
+}
+
+/* Passes on what comes until the user, the time, the device or the stream's own end ends it. */
+void relay(tool_link &control, tool_stream_source &source, const stream_output &out, tool_clock::time_point end,
+           stream_result &result)
+{
     auto told = std::min<tool_clock::time_point>(end, tool_clock::now() + kFirstBytes);
     for (;;) {
-        pollfd sockets[] = {{link.fd.get(), POLLIN, 0}, {ends.in.get(), POLLIN, 0}};
-        const tool_wait event = tool_wait_for(sockets, result.bytes == 0 ? told : end);
+        std::string bytes;
+        short wanted = 0;
+        const ssize_t n = tool_stream_take(source, control, bytes, wanted, result.why);
+        result.over = n < 0;
+        if (n < 0 || !write_patiently(out.fd(), out.shown(bytes), result.why))
+            return;
+        result.bytes += static_cast<std::uint64_t>(n);
+        pollfd sockets[] = {{control.fd.get(), POLLIN, 0}, {source.fd(), wanted, 0}};
+        const auto until = n > 0 ? tool_clock::now() : result.bytes == 0 ? told : end;
+        const tool_wait event = tool_wait_for(sockets, until);
         if (event == tool_wait::interrupted || tool_clock::now() >= end)
-            return result;
-        if (event == tool_wait::timeout) {
+            return;
+        if (event == tool_wait::timeout && n == 0) {
             std::fprintf(stderr, "nothing has come yet; still waiting\n");
             told = end;
-        } else if (sockets[0].revents != 0 && lost(link)) {
+        } else if (sockets[0].revents != 0 && !tool_still_there(control)) {
             result.device_lost = true;
-            result.why =
-                "the connection to " + link.where +
-                " ended. Another log tool may have taken it over; until one has it stop (stream LOG --stop), the "
-                "device goes on streaming to this PC";
-            return result;
-        } else if (sockets[1].revents != 0) {
-            const ssize_t n = pass_on(link, ends, result.why);
-            if (n < 0)
-                return result;
-            result.bytes += static_cast<std::uint64_t>(n);
+            result.why = lost(control);
+            return;
         }
     }
 }
 
-/* Has the device stop the stream; what is wrong with that, if anything. */
-std::string stop(tool_device &device, const std::string &log, bool answer_due)
+/* Passes on what was under way when the device was told to stop; it ends its link then. */
+void drain(tool_link &control, tool_stream_source &source, const stream_output &out, stream_result &result)
 {
-    std::string why;
-    if (answer_due && !tool_receive(*device.link, device.limits.reply, why))
-        return "the device may still be streaming: " + why;
-    const std::optional<tool_answer> answer = tool_exchange(device, stream_command(log, "end"), {}, why);
-    if (answer && answer->verdict != tool_verdict::success)
-        why = tool_said(device, *answer);
-    return why.empty() ? "" : "the device may still be streaming: " + why;
+    stream_result rest;
+    relay(control, source, out, tool_clock::now() + control.limits.stall, rest);
+    result.bytes += rest.bytes;
 }
 
-/* The file that the log goes to; none where that is standard output. False, and why, when it cannot go there. */
-bool open_output(const tool_stream_options &options, unique_fd &file, std::string &why)
+/* Opens what the log goes to; false, and why, when it cannot go there. */
+bool open_output(const tool_stream_options &options, stream_output &out, std::string &why)
 {
+    out.text = options.log == "syslog";
     if (options.output.empty()) {
-        if (options.log == "syslog" || isatty(STDOUT_FILENO) == 0)
+        if (out.text || isatty(STDOUT_FILENO) == 0)
             return true;
         why = "the modem's log is binary and not for a terminal: store it with --output";
         return false;
     }
-    file.reset(open(options.output.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666));
-    if (!file)
+    out.file.reset(open(options.output.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666));
+    if (!out.file)
         why = "cannot write " + options.output + ": " + std::strerror(errno);
-    return static_cast<bool>(file);
+    return static_cast<bool>(out.file);
 }
 
 int stop_only(tool_device &device, const std::string &log)
 {
     int status = kDone;
-    if (tool_ask(device, stream_command(log, "end"), status))
+    if (tool_ask(device, tool_stream_end_command(log), status))
         std::printf("The device was told to stop the stream.\n");
     return status;
 }
@@ -242,29 +132,31 @@ int stop_only(tool_device &device, const std::string &log)
 
 int tool_stream(tool_device &device, const tool_stream_options &options)
 {
-    if (device.called_at != nullptr)
-        return tool_fail(kNoAnswer, "a device that has called streams over links of its own, which are not taken yet");
     if (options.stop)
         return stop_only(device, options.log);
-    stream_ends ends;
-    std::string why;
-    if (!open_output(options, ends.out_file, why) || !tool_reach(device, why))
-        return tool_fail(kNoAnswer, why);
-    tool_catch_interrupts();
-    const stream_start started = start(device, options.log, ends);
+    stream_output out;
     stream_result result;
+    if (!open_output(options, out, result.why) || !tool_reach(device, result.why))
+        return tool_fail(kNoAnswer, result.why);
+    tool_catch_interrupts();
+    tool_stream_source source;
+    const tool_stream_start started = tool_stream_begin(device, options.log, out.file ? stdout : stderr, source);
     result.why = started.why;
-    if (started.answered && ends.in && started.why.empty()) {
+    if (source.opened() && started.answered && started.why.empty()) {
         std::fflush(stdout);
         std::fprintf(stderr, "The device says that it streams; Ctrl-C ends it.\n");
         const auto length = options.length.count() > 0 ? options.length : std::chrono::milliseconds(kForEver);
-        result = relay(*device.link, ends, tool_clock::now() + length);
+        relay(*device.link, source, out, tool_clock::now() + length, result);
     }
     tool_forget_interrupts();
     if (started.asked && !result.device_lost && device.link) {
-        const std::string wrong = stop(device, options.log, !started.answered);
+        const std::string wrong = tool_stream_end(device, options.log, !started.answered);
         result.why += (result.why.empty() || wrong.empty() ? "" : "; ") + wrong;
+        if (device.called_at != nullptr && source.opened() && !result.over && wrong.empty())
+            drain(*device.link, source, out, result);
     }
+    if (result.device_lost)
+        device.link.reset();
     if (!result.why.empty())
         return tool_fail(started.status, result.why);
     std::fprintf(stderr, "%s of the log received.%s\n", tool_bytes(result.bytes).c_str(),

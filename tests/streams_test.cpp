@@ -1,0 +1,321 @@
+#include "tests/daemon.h"
+#include "tools/tool_device.h"
+#include "tools/tool_listener.h"
+#include "tools/tool_process.h"
+
+#include <atomic>
+#include <fstream>
+#include <random>
+#include <thread>
+
+namespace
+{
+
+constexpr int kFeedSize = 1 << 20;
+const std::string kImei = "356938035643809";
+
+struct stream {
+    const char *log_type;
+    const char *connect_type;
+};
+constexpr stream kSyslog{"syslog", "syslog_connect"};
+constexpr stream kModem{"qxdm", "modemlog_connect"};
+
+/* This test is the log server; the device's log programs write a file that it knows. */
+class Streams : public testing::Test
+{
+protected:
+    void SetUp() override
+    {
+        tool_prepare_process(); /* a device that hangs up is an error like any other */
+        ASSERT_EQ("", run_command(SOURCE_DIR "/device/certificates /tmp/c"));
+        run_command("head -c " + std::to_string(kFeedSize) +
+                    " /dev/urandom >/tmp/feed; mkdir -p /logfs/logconf; "
+                    "touch /logfs/logconf/Diag.cfg; for p in syslogd diag_mdlog; do cp --remove-destination " FEEDER
+                    " /usr/vex/override/$p; done; echo 2000 >/tmp/feed.size");
+        feed_ = read_file("/tmp/feed");
+        listener_.port = "5000";
+    }
+    /* Has the device call. */
+    void call(bool tls, int feed_times)
+    {
+        std::string why;
+        set_nv("log_use_ssl_disable", tls ? "0" : "1");
+        run_command("echo " + std::to_string(feed_times) + " >/tmp/feed.times");
+        if (tls)
+            listener_.context = tool_tls_server("/tmp/c/server.crt", "/tmp/c/server.key", "/tmp/c/ca.crt", why);
+        ASSERT_TRUE(tool_listen(listener_, why)) << why;
+        daemon_.emplace(std::vector<std::string>{"-a", "127.0.0.1", "-p", "5000"});
+        control_.emplace(std::move(accept("9")->link));
+    }
+    std::optional<tool_call> accept(const char *msgid)
+    {
+        std::string why;
+        pollfd entry{listener_.fd.get(), POLLIN, 0};
+        EXPECT_EQ(1, poll(&entry, 1, kPatience));
+        std::optional<tool_call> call = tool_take_call(listener_, {}, why);
+        EXPECT_TRUE(call && call->msgid == msgid) << why;
+        return call;
+    }
+    std::string ask(const std::string &control)
+    {
+        std::string why;
+        EXPECT_TRUE(tool_send(*control_, control, {}, why)) << why;
+        const auto frame = tool_receive(*control_, std::chrono::milliseconds(kPatience), why);
+        return frame ? frame->control : why;
+    }
+    std::string ask(const stream &which, const char *action)
+    {
+        return ask(
+            tool_command("6", "realtimeLog",
+                         {{"LogType", which.log_type}, {"Action", action}, {"ip", "127.0.0.1"}, {"port", "5000"}}));
+    }
+    /* Starts a stream; its data link, which is not confirmed yet. */
+    tool_link start(const stream &which)
+    {
+        EXPECT_EQ(
+            R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":"5000","ip":"127.0.0.1"},"Result":"Success"})",
+            ask(which, "start"));
+        std::optional<tool_call> call = accept("10");
+        EXPECT_EQ(which.connect_type, tool_announced(*call, "DataLink", "ConnectType"));
+        EXPECT_EQ(kImei, tool_announced(*call, "DataLink", "imei"));
+        return std::move(call->link);
+    }
+    static void confirm(tool_link &link, const stream &which)
+    {
+        std::string why;
+        EXPECT_TRUE(tool_send(
+            link, tool_command("10", "DataLink", {{"imei", kImei}, {"ConnectType", which.connect_type}}), {}, why));
+    }
+    void end(const stream &which)
+    {
+        EXPECT_EQ(
+            R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":"0","ip":""},"Result":"Success"})",
+            ask(which, "end"));
+    }
+    /* Takes bytes off a link until there were so many or it has ended; whether all were the log's, and how many. */
+    std::pair<bool, std::size_t> take(tool_link &link, std::size_t count) const
+    {
+        std::size_t got = 0;
+        bool equal = true;
+        unsigned char piece[65536];
+        while (got < count) {
+            short wanted = POLLIN;
+            const ssize_t n = tool_read_some(link, {piece, std::min(sizeof piece, count - got)}, wanted);
+            for (ssize_t i = 0; i < n; ++i)
+                equal = equal && static_cast<char>(piece[i]) == feed_[got++ % feed_.size()];
+            pollfd entry{link.fd.get(), wanted, 0};
+            if (n == 0 || (n < 0 && errno != EAGAIN) || (n < 0 && poll(&entry, 1, kPatience) != 1))
+                break;
+        }
+        return {equal, got};
+    }
+    /* Waits for the device to end a link. */
+    bool ended(tool_link &link) const { return take(link, SIZE_MAX).second < SIZE_MAX; }
+    /* The daemon's descriptors and threads. */
+    using resources = std::pair<std::size_t, std::size_t>;
+    resources used() const { return {entries(daemon_->proc("fd")), entries(daemon_->proc("task"))}; }
+    /* Whether it comes to have as many as at another time. */
+    bool settles(const resources &before) const
+    {
+        const auto end = tool_clock::now() + std::chrono::milliseconds(kPatience);
+        while (used() != before && tool_clock::now() < end)
+            std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
+        return used() == before;
+    }
+    /* Its memory, in kB. */
+    long resident() const { return std::stol(run_command("sed -n 's/VmRSS:[ \t]*//p' " + daemon_->proc("status"))); }
+    /* The device's daemon ends with its server. */
+    void hang_up()
+    {
+        control_.reset();
+        EXPECT_EQ(0, daemon_->wait_exit());
+        daemon_.reset();
+        listener_.fd.reset();
+    }
+
+    std::string feed_;
+    tool_listener listener_;
+    std::optional<daemon_process> daemon_;
+    std::optional<tool_link> control_;
+};
+
+TEST_F(Streams, BringEveryByteWhileCommandsAreAnswered)
+{
+    for (const bool tls : {false, true}) {
+        const char *const mb = getenv("VEX_STREAM_MB"); /* for longer streams, by hand */
+        const int times = mb != nullptr ? std::atoi(mb) : 8;
+        call(tls, times);
+        tool_link links[] = {start(kSyslog), start(kModem)};
+        std::atomic<int> running = 2;
+        std::pair<bool, std::size_t> got[2];
+        std::thread readers[2];
+        daemon_->commands();
+        for (std::size_t i = 0; i < 2; ++i) {
+            confirm(links[i], i == 0 ? kSyslog : kModem);
+            readers[i] = std::thread([this, &running, &got, &links, i, times] {
+                got[i] = take(links[i], static_cast<std::size_t>(times) * feed_.size());
+                --running;
+            });
+        }
+        while (running > 0)
+            EXPECT_EQ(kOnline, ask(kAskMode));
+        for (std::size_t i = 0; i < 2; ++i) {
+            readers[i].join();
+            EXPECT_TRUE(got[i].first);
+            EXPECT_EQ(static_cast<std::size_t>(times) * feed_.size(), got[i].second);
+        }
+        const std::string commands = daemon_->commands();
+        for (const char *line : {"killall -9 syslogd\n", "\nsyslogd -R tcp_fd=", "killall -9 diag_mdlog\n",
+                                 "echo 3 > /proc/sys/vm/drop_caches\n", "rm /tmp/diag_logs\n",
+                                 "diag_mdlog -f /logfs/logconf/Diag.cfg -o /tmp/diag_logs -n 2 -s 10 -R tcp_fd="})
+            EXPECT_NE(std::string::npos, commands.find(line)) << line << commands;
+        end(kSyslog);
+        end(kModem);
+        EXPECT_TRUE(ended(links[0]) && ended(links[1]));
+        hang_up();
+    }
+}
+
+TEST_F(Streams, LeaveNothingBehind)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 2);
+        const char *const given = getenv("VEX_STREAM_CYCLES"); /* for more of them, by hand */
+        const int cycles = given != nullptr ? std::atoi(given) : 30;
+        const resources rest = used();
+        long memory = 0;
+        for (int i = 0; i < cycles; ++i) {
+            tool_link syslog = start(kSyslog);
+            tool_link modem = start(kModem);
+            confirm(syslog, kSyslog);
+            confirm(modem, kModem);
+            EXPECT_EQ(std::pair(true, feed_.size()), take(syslog, feed_.size()));
+            EXPECT_EQ(std::pair(true, feed_.size()), take(modem, feed_.size()));
+            end(kSyslog);
+            end(kModem);
+            EXPECT_TRUE(ended(syslog) && ended(modem));
+            if (i == 9)
+                memory = resident();
+        }
+        EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
+        EXPECT_GE(memory + 200, resident());
+        hang_up();
+    }
+}
+
+TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 1000);
+        const resources rest = used();
+        for (const stream &which : {kSyslog, kModem}) {
+            end(which); /* without a start */
+            {
+                tool_link link = start(which); /* ended before it is confirmed; the confirmation comes too late */
+                end(which);
+                confirm(link, which);
+                EXPECT_TRUE(ended(link));
+                EXPECT_TRUE(settles(rest));
+            }
+            {
+                const tool_link never_confirmed = start(which);
+            }
+            EXPECT_TRUE(settles(rest)) << "the server has hung up";
+            {
+                tool_link first = start(which); /* started twice: the second takes the first one's place */
+                confirm(first, which);
+                EXPECT_TRUE(take(first, 100000).first);
+                tool_link second = start(which);
+                EXPECT_TRUE(ended(first));
+                end(which);
+                EXPECT_TRUE(ended(second));
+                EXPECT_TRUE(settles(rest));
+            }
+            {
+                tool_link link = start(which);
+                confirm(link, which);
+                EXPECT_TRUE(take(link, 100000).first);
+                confirm(link, which); /* once more */
+                EXPECT_EQ(kOnline, ask(kAskMode));
+                end(which);
+                EXPECT_TRUE(ended(link));
+                EXPECT_TRUE(settles(rest));
+            }
+            {
+                tool_link deaf = start(which); /* its server stops reading: a stop works all the same */
+                confirm(deaf, which);
+                EXPECT_TRUE(take(deaf, 100000).first);
+                end(which);
+                EXPECT_TRUE(settles(rest));
+            }
+            tool_link link = start(which);
+            confirm(link, which);
+            EXPECT_EQ(std::pair(true, std::size_t{3000000}), take(link, 3000000));
+            end(which);
+        }
+        hang_up();
+    }
+}
+
+TEST_F(Streams, AreConfirmedByTheDevicesOwnServerOnly)
+{
+    call(true, 1);
+    tool_link link = start(kSyslog);
+    std::string why;
+    const auto send = [&](const std::string &control) { EXPECT_TRUE(tool_send(link, control, {}, why)); };
+    daemon_->commands();
+    send(R"({"msgid":"10"})");
+    send(R"({"msgid":"10","DataLink":{"imei":"356938035643808","ConnectType":"syslog_connect"}})");
+    send(R"({"msgid":"10","DataLink":{"ConnectType":"syslog_connect"}})");
+    send(R"({"msgid":"10","DataLink":{"imei":"356938035643809"}})");
+    send(R"({"msgid":"10","DataLink":{"imei":"356938035643809","ConnectType":"SYSLOG_CONNECT"}})");
+    EXPECT_TRUE(daemon_->logs("unknow ConnectType = [SYSLOG_CONNECT]"));
+    EXPECT_EQ("", daemon_->commands());
+    for (const char *line : {"cannot find K_DataLink item", "imei = [356938035643808] is incorrect",
+                             "cannot find K_Imei item", "cannot find K_ConnectType item"})
+        EXPECT_EQ(1, daemon_->logged(line)) << line;
+    send(R"({"msgid":"10","datalink":{"IMEI":"356938035643809","connecttype":"syslog_connect"}})");
+    EXPECT_EQ(std::pair(true, feed_.size()), take(link, feed_.size()));
+    hang_up();
+}
+
+/* Whatever comes at whatever moment: streams that flow, and are ended from either side or started once more. */
+TEST_F(Streams, EndAtAnyMoment)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 1000);
+        const resources rest = used();
+        std::mt19937 random{2206};
+        for (int i = 0; i < 25; ++i) {
+            std::optional<tool_link> links[2];
+            for (int j = 0; j < 4; ++j) {
+                const std::size_t at = random() % 2;
+                const stream &which = at == 0 ? kSyslog : kModem;
+                switch (random() % 4) {
+                case 0:
+                    end(which);
+                    break;
+                case 1:
+                    links[at].reset(); /* the server hangs up */
+                    break;
+                default:
+                    links[at] = start(which);
+                    if (random() % 4 != 0)
+                        confirm(*links[at], which);
+                    if (random() % 2 == 0)
+                        ask(kAskMode);
+                }
+                for (auto &link : links)
+                    if (link && random() % 2 == 0)
+                        take(*link, 0);
+            }
+            end(kSyslog);
+            end(kModem);
+        }
+        EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
+        hang_up();
+    }
+}
+
+} // namespace
