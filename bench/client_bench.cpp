@@ -13,7 +13,7 @@ namespace
 
 constexpr std::uint16_t kPort = 5000;
 constexpr std::uint16_t kLibraryPort = 5001; /* of the TLS library's own server */
-constexpr int kProcesses = 9;
+constexpr int kProcesses = 5;
 constexpr int kRounds = 3;
 constexpr auto kPatience = std::chrono::seconds(10);
 
@@ -99,24 +99,30 @@ tls_link call_library_server()
     return link;
 }
 
+/* What a sender took, from the first byte on. */
+struct sending_cost {
+    double seconds;
+    double processor;
+};
+
 /*
- * Takes a session's records off its socket until they have brought so many bytes, or the peer is done; seconds from the
- * first byte on. They are not decrypted, which would cost more than all that the sender does but the same for every
+ * Takes a session's records off its socket until they have brought so many bytes. They are not decrypted, which would cost more than all that the sender does but the same for every
  * sender: the session cannot be read from any more.
  */
-double take_records(const tls_link &link, std::size_t content)
+sending_cost take_records(const tls_link &link, std::size_t content, pid_t sender)
 {
     constexpr std::size_t kHeader = 5;
     constexpr std::size_t kOverhead = 17; /* of a record in TLS 1.3: the type and the tag */
     static unsigned char piece[1 << 18];
     std::size_t at = 0; /* of the next record's header, from the start of the piece */
     std::size_t held = 0;
-    double start = 0;
+    sending_cost start{0, 0};
     while (content > 0) {
         const ssize_t n = recv(link.fd.get(), piece + held, sizeof piece - held, 0);
         if (n <= 0)
             give_up("archive");
-        start = start == 0 ? now() : start;
+        if (start.seconds == 0)
+            start = {now(), processor_time(sender)};
         held += static_cast<std::size_t>(n);
         for (; at + kHeader <= held; at += kHeader + (piece[at + 3] << 8 | piece[at + 4]))
             content -= std::min(content, static_cast<std::size_t>(piece[at + 3] << 8 | piece[at + 4]) - kOverhead);
@@ -125,23 +131,23 @@ double take_records(const tls_link &link, std::size_t content)
         at -= held - rest;
         held = rest;
     }
-    return now() - start;
+    return {now() - start.seconds, processor_time(sender) - start.processor};
 }
 
-double fetch_from_library_server()
+double fetch_from_library_server(pid_t server)
 {
     const tls_link link = call_library_server();
     link.write("GET /big HTTP/1.0\r\n\r\n");
-    return take_records(link, kArchiveSize);
+    return take_records(link, kArchiveSize, server).seconds;
 }
 
-double fetch_archive(const tls_link &link)
+double fetch_archive(const tls_link &link, pid_t sender)
 {
     constexpr std::size_t kFrames = (kArchiveSize + 51199) / 51200;
     const std::size_t control =
         sizeof R"({"msgid":"2","GetLocalLog":{"totalLength":"268435456"},"Result":"Success"})" - 1;
     link.write(make_frame(R"({"msgid":"2"})"));
-    return take_records(link, kArchiveSize + kFrames * (12 + control));
+    return take_records(link, kArchiveSize + kFrames * (12 + control), sender).seconds;
 }
 
 void print_rates(const char *beside, const comparison &s)
@@ -166,9 +172,9 @@ void measure_archive(const log_server &server, const char *floor_client)
         const tls_link floor = accept_call(server);
         const program daemon_process({"vex_log_manage", "-a", "127.0.0.1", "-p", std::to_string(kPort)});
         const tls_link daemon = accept_device(server);
-        const auto fetch = [&daemon] { return fetch_archive(daemon); };
-        beside_floor.add(kRounds, fetch, [&floor] { return fetch_archive(floor); });
-        beside_library.add(kRounds, fetch, fetch_from_library_server);
+        const auto fetch = [&] { return fetch_archive(daemon, daemon_process.pid()); };
+        beside_floor.add(kRounds, fetch, [&] { return fetch_archive(floor, floor_process.pid()); });
+        beside_library.add(kRounds, fetch, [&] { return fetch_from_library_server(library_process.pid()); });
         peak = std::max(peak, peak_kib(daemon_process.pid()));
     }
     print_rates("plain program", beside_floor.medians());
@@ -177,11 +183,103 @@ void measure_archive(const log_server &server, const char *floor_client)
     restore_tar();
 }
 
+/* ---- The relay of a live log, from a local socket to TLS ---- */
+
+constexpr std::size_t kLogSize = 64 << 20;
+constexpr char kFloorSocket[] = "/tmp/floor.sock";
+
+std::string stream_command(const char *action)
+{
+    return make_frame(std::string(R"({"msgid":"6","realtimeLog":{"LogType":"syslog","Action":")") + action +
+                      R"(","ip":"127.0.0.1","port":"5000"}})");
+}
+
+/* Reads one frame's worth of an answer that is known to be a frame. */
+void await_answer(const tls_link &link)
+{
+    std::string answer;
+    char piece[2000];
+    while (!answer.ends_with("~#")) {
+        const ssize_t n = link.read(piece, sizeof piece);
+        if (n <= 0)
+            give_up("answer");
+        answer.append(piece, static_cast<std::size_t>(n));
+    }
+}
+
+/* The daemon: a start, the log, an end. */
+sending_cost relay_by_daemon(const log_server &server, const tls_link &control, pid_t daemon)
+{
+    control.write(stream_command("start"));
+    const tls_link link = accept_device(server);
+    await_answer(control);
+    link.write(make_frame(R"({"msgid":"10","DataLink":{"imei":"356938035643809","ConnectType":"syslog_connect"}})"));
+    const sending_cost cost = take_records(link, kLogSize, daemon);
+    control.write(stream_command("end"));
+    await_answer(control);
+    return cost;
+}
+
+/* A program that listens at kFloorSocket and calls the server; either first, as it likes. */
+sending_cost relay_by(const log_server &server, const std::vector<std::string> &words, const char *feeder)
+{
+    unlink(kFloorSocket);
+    const program relay(words);
+    const program log_program({feeder, "-R", std::string("unix=") + kFloorSocket});
+    const tls_link link = accept_call(server);
+    return take_records(link, kLogSize, relay.pid());
+}
+
+void measure_relay(const log_server &server, const std::string &floor_client, const char *feeder, int write_size)
+{
+    const std::string certs = "/usr/vex/vex_conf/logcert/";
+    const std::vector<std::string> relays[] = {
+        {floor_client, "relay", std::to_string(kPort), kFloorSocket},
+        {"stunnel", "/tmp/stunnel.conf"},
+        {"socat", "-u", std::string("UNIX-LISTEN:") + kFloorSocket,
+         "OPENSSL:127.0.0.1:5000,verify=0,cert=" + certs + "logclient_cert.crt,key=" + certs + "logkey.pem"}};
+    const char *const names[] = {"plain program", "stunnel", "socat"};
+    shell((std::string("cp ") + feeder +
+           " /usr/vex/override/syslogd; head -c 1048576 /dev/urandom >/tmp/feed; "
+           "echo 64 >/tmp/feed.times; echo " +
+           std::to_string(write_size) +
+           " >/tmp/feed.size; "
+           "printf 'foreground=yes\\npid=\\n[relay]\\nclient=yes\\naccept=/tmp/floor.sock\\nconnect=127.0.0.1:5000\\n"
+           "cert=" +
+           certs + "logclient_cert.crt\\nkey=" + certs + "logkey.pem\\n' >/tmp/stunnel.conf")
+              .c_str());
+    paired_rounds speed[3];
+    paired_rounds processor[3];
+    long peak = 0;
+    for (int i = 0; i < kProcesses; ++i) {
+        const program daemon_process({"vex_log_manage", "-a", "127.0.0.1", "-p", std::to_string(kPort)});
+        const tls_link control = accept_device(server);
+        for (std::size_t j = 0; j < 3; ++j)
+            for (int round = 0; round < kRounds; ++round) {
+                const sending_cost floor = relay_by(server, relays[j], feeder);
+                const sending_cost ours = relay_by_daemon(server, control, daemon_process.pid());
+                speed[j].add(
+                    1, [&] { return ours.seconds; }, [&] { return floor.seconds; });
+                processor[j].add(
+                    1, [&] { return ours.processor; }, [&] { return floor.processor; });
+            }
+        peak = std::max(peak, peak_kib(daemon_process.pid()));
+    }
+    for (std::size_t j = 0; j < 3; ++j) {
+        const comparison s = speed[j].medians();
+        std::printf(
+            "relay of writes of %4d bytes   %8.0f MB/s   %-17s%8.0f MB/s   ratio %.3f   its processor time %.3f\n",
+            write_size, kLogSize / s.daemon / 1e6, names[j], kLogSize / s.floor / 1e6, 1 / s.ratio,
+            processor[j].medians().ratio);
+    }
+    std::printf("  the daemon's peak memory     %8ld KiB\n", peak);
+}
+
 } // namespace
 
 int main(int argc, char **argv)
 {
-    if (argc != 3)
+    if (argc != 4)
         return 2;
     prepare_measuring();
     shell((std::string(argv[1]) + "/device/certificates /tmp/certs").c_str());
@@ -190,6 +288,8 @@ int main(int argc, char **argv)
     server.context = tool_tls_server("/tmp/certs/server.crt", "/tmp/certs/server.key", "/tmp/certs/ca.crt", why);
     if (!server.context)
         give_up_tls(why);
+    for (const int write_size : {2000, 200})
+        measure_relay(server, argv[2], argv[3], write_size);
     measure_archive(server, argv[2]);
     return 0;
 }

@@ -3,6 +3,7 @@
  * calls, one after the other, what it is there for.
  *
  *   floor_client archive PORT FILE    sends a file as frames of 51200 bytes for each command that it reads
+ *   floor_client relay PORT PATH      sends on what a program writes to a local socket
  */
 #include "bench/archive_frames.h"
 
@@ -11,6 +12,7 @@
 #include <netinet/in.h>
 #include <openssl/ssl.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 namespace
 {
@@ -50,6 +52,23 @@ int send_archive(SSL *session, const char *path)
     return 0;
 }
 
+int relay(SSL *session, const char *path)
+{
+    sockaddr_un at{};
+    at.sun_family = AF_UNIX;
+    std::strncpy(at.sun_path, path, sizeof at.sun_path - 1);
+    const unique_fd listener{socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    unlink(path);
+    if (bind(listener.get(), reinterpret_cast<const sockaddr *>(&at), sizeof at) != 0 || listen(listener.get(), 1) != 0)
+        return 1;
+    const unique_fd program{accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC)};
+    char piece[kReadSize];
+    for (ssize_t n = 0; (n = recv(program.get(), piece, sizeof piece, 0)) > 0;)
+        if (SSL_write(session, piece, static_cast<int>(n)) <= 0)
+            return 1;
+    return 0;
+}
+
 } // namespace
 
 int main(int argc, char **argv)
@@ -61,5 +80,7 @@ int main(int argc, char **argv)
         return 1;
     if (std::strcmp(argv[1], "archive") == 0)
         return send_archive(session, argv[3]);
+    if (std::strcmp(argv[1], "relay") == 0)
+        return relay(session, argv[3]);
     return 2;
 }

@@ -7,6 +7,7 @@
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <ctime>
 #include <fcntl.h>
 #include <fstream>
 #include <netinet/in.h>
@@ -167,6 +168,15 @@ double read_archive(const std::function<ssize_t(void *bytes, std::size_t len)> &
         left -= static_cast<std::size_t>(n);
     } while (left > 0);
     return now() - start;
+}
+
+double processor_time(pid_t pid)
+{
+    clockid_t clock{};
+    timespec used{};
+    if (clock_getcpuclockid(pid, &clock) != 0 || clock_gettime(clock, &used) != 0)
+        give_up("processor time");
+    return static_cast<double>(used.tv_sec) + static_cast<double>(used.tv_nsec) / 1e9;
 }
 
 long peak_kib(pid_t pid)

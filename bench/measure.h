@@ -76,6 +76,9 @@ void restore_tar();
 /* Reads frames until the file that they carry is complete; seconds from the first byte on. `read` is as recv(). */
 double read_archive(const std::function<ssize_t(void *bytes, std::size_t len)> &read);
 
+/* Seconds of processor time that the process has used. */
+double processor_time(pid_t pid);
+
 /* Largest memory that the process ever had, in KiB. */
 long peak_kib(pid_t pid);
 

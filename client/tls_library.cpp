@@ -2,8 +2,12 @@
 
 #include "core/log_line.h"
 
+#include <cstdint>
 #include <cstring>
 #include <dlfcn.h>
+#include <link.h>
+#include <sys/mman.h>
+#include <unistd.h>
 
 namespace
 {
@@ -20,9 +24,29 @@ template <typename Call> bool find(void *library, const char *name, Call &call)
     return address != nullptr;
 }
 
+/* Gives back the memory of an object's pages that are as in its file; they come back when they are used. */
+int give_back(dl_phdr_info *object, size_t, void *)
+{
+    const auto page = static_cast<std::uintptr_t>(sysconf(_SC_PAGESIZE));
+    for (int i = 0; i < object->dlpi_phnum; ++i) {
+        const ElfW(Phdr) &segment = object->dlpi_phdr[i];
+        if (segment.p_type != PT_LOAD || (segment.p_flags & PF_W) != 0)
+            continue;
+        const std::uintptr_t start = object->dlpi_addr + segment.p_vaddr;
+        const std::uintptr_t first = start / page * page;
+        madvise(reinterpret_cast<void *>(first), start + segment.p_memsz - first, MADV_DONTNEED);
+    }
+    return 0;
+}
+
 } // namespace
 
 tls_calls g_tls;
+
+void tls_library_settle()
+{
+    dl_iterate_phdr(give_back, nullptr);
+}
 
 bool tls_library_load()
 {

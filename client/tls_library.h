@@ -35,4 +35,8 @@ extern tls_calls g_tls;
  * other thread of client mode exists. */
 bool tls_library_load();
 
+/* Gives back the memory that start-up has taken up with what only start-up needed of the program and its libraries, a
+ * megabyte and more. */
+void tls_library_settle();
+
 #endif

@@ -21,6 +21,7 @@ namespace
 constexpr auto kForEver = tls_clock::time_point::max();
 /* What a writer waits to read, the reader may have taken off the socket: it looks again that often. */
 constexpr auto kLookAgain = std::chrono::milliseconds(100);
+constexpr std::size_t kHoldMax = 16384;   /* bytes that may wait for more to come */
 constexpr std::size_t kOutboxMax = 65536; /* with more in it nothing is begun, so that a peer cannot make it grow */
 
 struct malloc_deleter {
@@ -36,8 +37,11 @@ struct session_extra {
     std::size_t room = 0;
     std::size_t from = 0;
     std::size_t to = 0;
+    bool holding = false;
 
     std::size_t waiting() const { return to - from; }
+    /* Whether what waits may go on waiting for more. */
+    bool held_back() const { return holding && waiting() < kHoldMax; }
 };
 
 BIO_METHOD *g_outbox_method;
@@ -94,7 +98,9 @@ int write_outbox(BIO *outbox, const char *bytes, int len)
 {
     session_extra &extra = *static_cast<session_extra *>(g_tls.BIO_get_data(outbox));
     ssize_t sent = 0;
-    if (extra.waiting() == 0 && (sent = send_some(extra.fd, bytes, static_cast<std::size_t>(len))) < 0)
+    if (extra.waiting() == 0 && !extra.holding)
+        sent = send_some(extra.fd, bytes, static_cast<std::size_t>(len));
+    if (sent < 0)
         return -1;
     return sent == len || keep(extra, bytes + sent, static_cast<std::size_t>(len - sent)) ? len : -1;
 }
@@ -122,6 +128,17 @@ enum class session_wait {
     until_shaken /* hands: nobody else uses the session yet */
 };
 
+/* What a call that had no result waits for, or why it failed. The thread's error queue, by which the library tells that,
+ * is empty before and after: to empty it before each call would cost more than all else that is done here. */
+int what_is_wanted(SSL *session, int result)
+{
+    const int error = errno;
+    const int wanted = g_tls.SSL_get_error(session, result);
+    g_tls.ERR_clear_error();
+    errno = error;
+    return wanted;
+}
+
 /* Runs a library call on the session until it has a result above 0, the session has ended or the time has come. */
 template <typename Call> int run(SSL *session, session_wait kind, tls_clock::time_point end, const Call &call)
 {
@@ -133,15 +150,16 @@ template <typename Call> int run(SSL *session, session_wait kind, tls_clock::tim
         {
             const log_lock hold{extra.lock};
             errno = 0;
-            if (!pass_on(extra))
+            if (!extra.held_back() && !pass_on(extra))
                 return -1;
             if (result <= 0 && extra.waiting() < kOutboxMax) {
-                g_tls.ERR_clear_error();
                 errno = 0;
                 result = call();
-                wanted = result > 0 ? SSL_ERROR_NONE : g_tls.SSL_get_error(session, result);
+                wanted = result > 0 ? SSL_ERROR_NONE : what_is_wanted(session, result);
+                if (extra.holding && !extra.held_back() && !pass_on(extra))
+                    return -1;
             }
-            waiting = extra.waiting();
+            waiting = extra.held_back() ? 0 : extra.waiting();
         }
         if (result > 0 && (kind != session_wait::until_sent || waiting == 0))
             return result;
@@ -196,6 +214,7 @@ SSL *tls_session_new(SSL_CTX *context, int fd)
 
 bool tls_session_connect(SSL *session, tls_clock::time_point end)
 {
+    g_tls.ERR_clear_error(); /* whatever else the thread has used the library for */
     return run(session, session_wait::until_shaken, end, [session] { return g_tls.SSL_connect(session); }) == 1;
 }
 
@@ -211,9 +230,22 @@ int tls_session_write(SSL *session, const void *bytes, int len)
                          [session, bytes, len] { return g_tls.SSL_write(session, bytes, len); }));
 }
 
+void tls_session_hold(SSL *session, bool on)
+{
+    session_extra &extra = *extra_of(session);
+    {
+        const log_lock hold{extra.lock};
+        extra.holding = on;
+    }
+    if (!on)
+        run(session, session_wait::until_sent, kForEver, [] { return 1; });
+}
+
 void tls_session_free(SSL *session)
 {
     const std::unique_ptr<session_extra> extra{extra_of(session)};
     g_tls.SSL_shutdown(session);
+    pass_on(*extra);
     g_tls.SSL_free(session);
+    g_tls.ERR_clear_error();
 }

@@ -30,6 +30,10 @@ int tls_session_read(SSL *session, void *bytes, int len);
  * What several threads write stays in one piece each. */
 int tls_session_write(SSL *session, const void *bytes, int len);
 
+/* From now on what is written may wait until there is enough of it for the network, or no longer: then all of it is sent
+ * before this returns. For a writer that has more to write at once. */
+void tls_session_hold(SSL *session, bool on);
+
 /* Says good-bye, as far as the socket takes it at once, and frees the session. Nobody else may be using it any more. */
 void tls_session_free(SSL *session);
 

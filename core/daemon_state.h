@@ -17,6 +17,7 @@ struct log_daemon_state {
      * use for a TLS library and the memory it takes, so the daemon is not linked with one. Reads and writes wait. */
     int (*ssl_read)(SSL *ssl, void *bytes, int len) = nullptr;
     int (*ssl_write)(SSL *ssl, const void *bytes, int len) = nullptr;
+    void (*ssl_hold)(SSL *ssl, bool on) = nullptr; /* for a burst of writes: they may reach the network together */
     void (*close_ssl)(SSL *ssl, int free_context) = nullptr;
     std::atomic<int> syslog_realtime_on{0}; /* 1 while the system log is streamed instead of kept on the device */
     std::atomic<int> exit_flag{0};          /* set to 1 to end the process; start-up looks at it every 5 seconds */

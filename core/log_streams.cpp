@@ -2,6 +2,7 @@
 
 #include "core/daemon_state.h"
 
+#include <atomic>
 #include <cstring>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -24,7 +25,7 @@ struct stream_state {
     unsigned stops LOG_GUARDED_BY(g_registry_lock) = 0;           /* so many times stopped */
     unsigned last_serial LOG_GUARDED_BY(g_registry_lock) = 0;     /* of the latest link, whether it stands or not */
     unsigned producer_serial LOG_GUARDED_BY(g_registry_lock) = 0; /* of the link that the latest producer was for */
-    int sending_fd LOG_GUARDED_BY(g_registry_lock) = -1; /* the link, or one before, that a send is under way on */
+    std::atomic<int> sending_fd{-1}; /* the link, or one before, that a send is under way on */
     int intakes_starting LOG_GUARDED_BY(g_registry_lock) = 0;
     int intake_fd LOG_GUARDED_BY(g_registry_lock) = -1; /* where an intake waits for the producer */
 };
@@ -194,14 +195,14 @@ void log_local_record(log_stream stream, int fd)
 log_link_use::log_link_use(log_stream stream) : stream_(stream), sending_(state_of(stream).send_lock)
 {
     const log_lock hold{g_registry_lock};
-    fd_ = state_of(stream).sending_fd = link_fd(stream);
+    fd_ = link_fd(stream);
+    state_of(stream).sending_fd = fd_;
     ssl_ = link_ssl(stream);
 }
 
 log_link_use::~log_link_use()
 {
-    const log_lock hold{g_registry_lock};
-    state_of(stream_).sending_fd = -1;
+    state_of(stream_).sending_fd.store(-1, std::memory_order_release); /* seen late, it makes the owner wait in vain */
 }
 
 void log_intake_starting(log_stream stream)

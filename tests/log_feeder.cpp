@@ -3,6 +3,7 @@
  * is given, as often as /tmp/feed.times says and /tmp/feed.size bytes at a time, and then stays until it is killed.
  *
  *   NAME ... -R tcp_fd=N ...    writes
+ *   NAME ... -R unix=PATH ...   writes to a socket that it connects to, as the daemon would for it
  *   NAME -k                     kills the NAME that writes
  *   NAME ...                    does nothing
  */
@@ -14,8 +15,10 @@
 #include <fstream>
 #include <iterator>
 #include <poll.h>
+#include <sched.h>
 #include <string>
 #include <sys/socket.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 namespace
@@ -45,6 +48,18 @@ bool send_whole(int fd, const char *bytes, std::size_t len)
     return true;
 }
 
+/* A non-blocking connection to a local socket, tried until somebody listens there. */
+int connect_to(const char *path)
+{
+    sockaddr_un to{};
+    to.sun_family = AF_UNIX;
+    std::strncpy(to.sun_path, path, sizeof to.sun_path - 1);
+    const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK, 0);
+    while (connect(fd, reinterpret_cast<const sockaddr *>(&to), sizeof to) != 0)
+        sched_yield();
+    return fd;
+}
+
 void feed(int fd)
 {
     const std::string log = contents("/tmp/feed");
@@ -65,6 +80,8 @@ int main(int argc, char **argv)
     for (int i = 1; i < argc; ++i) {
         if (std::strcmp(argv[i], "-k") == 0)
             return kill(std::stoi(contents(pid_file)), SIGKILL);
+        if (std::strncmp(argv[i], "unix=", 5) == 0)
+            feed(connect_to(argv[i] + 5));
         if (std::strncmp(argv[i], "tcp_fd=", 7) == 0) {
             std::ofstream(pid_file) << getpid();
             feed(std::atoi(argv[i] + 7));

@@ -1,5 +1,6 @@
 #include "transport/log_intake.h"
 
+#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_streams.h"
 #include "core/log_threads.h"
@@ -8,9 +9,11 @@
 
 #include <cerrno>
 #include <cstring>
+#include <sched.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
+#include <utility>
 
 namespace
 {
@@ -18,7 +21,7 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 
 constexpr int kBacklog = 1;
-constexpr std::size_t kPieceMax = 2000;         /* bytes that are taken, and sent on, at a time */
+constexpr int kPieceMax = 2000;                 /* bytes that are taken, and sent on, at a time */
 constexpr useconds_t kInterruptedPause = 20000; /* microseconds */
 
 /* Stores a socket that listens at the path; -1 on failure (logged), and nothing is stored. */
@@ -51,24 +54,77 @@ int vex_create_unix_server_socket(const char *path, int *out_fd)
     return 0;
 }
 
+/* Logs why the program's bytes have ended: an error, or 0. */
+void log_end(int error, int log_type)
+{
+    constexpr char kName[] = "log_server_handle_realtimelog";
+    if (error != 0)
+        LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(error));
+    else
+        LOG_NOTE("%s:recvcount=0,client close log_type=[%d]\n", kName, log_type);
+}
+
+/*
+ * Sends pieces on as they come. While they come full, there is more behind them, and the network need not have each by
+ * itself: then the link's session may hold them back, until there is nothing more to read.
+ */
+class log_forwarder
+{
+public:
+    explicit log_forwarder(log_stream stream) : stream_(stream) {}
+
+    /* How to receive the next piece: while something may be held back, without waiting. */
+    int receive_flags() const { return holding_ != nullptr ? MSG_DONTWAIT : 0; }
+
+    /* Without a link that takes them, bytes are lost. */
+    void send(const unsigned char *piece, int len)
+    {
+        const log_link_use link{stream_};
+        if (len == kPieceMax && link.ssl() != holding_) {
+            holding_ = link.ssl();
+            if (holding_ != nullptr)
+                g_daemon.ssl_hold(holding_, true);
+        }
+        log_send_packet(link.fd(), link.ssl(), piece, len);
+    }
+
+    /* Has what is held back sent; false when nothing was. */
+    bool let_go()
+    {
+        const log_link_use link{stream_};
+        SSL *const held = std::exchange(holding_, nullptr);
+        if (held != nullptr && held == link.ssl()) /* else it went with its link */
+            g_daemon.ssl_hold(held, false);
+        return held != nullptr;
+    }
+
+private:
+    const log_stream stream_;
+    SSL *holding_ = nullptr;
+};
+
 /* Sends on what the program writes until it has closed its end. */
 void forward(int fd, log_stream stream, int log_type)
 {
-    constexpr char kName[] = "log_server_handle_realtimelog";
     unsigned char piece[kPieceMax] = {};
-    for (;;) {
-        const ssize_t n = recv(fd, piece, sizeof piece, 0);
-        if (n == -1 && errno == EINTR) {
+    log_forwarder forwarder{stream};
+    for (bool yielded = false;;) {
+        const ssize_t n = recv(fd, piece, sizeof piece, forwarder.receive_flags());
+        if (n > 0) {
+            forwarder.send(piece, static_cast<int>(n));
+            yielded = false;
+        } else if (n == -1 && errno == EINTR) {
             usleep(kInterruptedPause);
-        } else if (n == -1) {
-            LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(errno));
+        } else if (n == -1 && errno == EAGAIN) {
+            if (yielded)
+                forwarder.let_go();
+            else
+                sched_yield(); /* a program that floods gets to write more than the few bytes that would wake us */
+            yielded = true;
+        } else {
+            log_end(n == -1 ? errno : 0, log_type);
+            forwarder.let_go();
             return;
-        } else if (n == 0) {
-            LOG_NOTE("%s:recvcount=0,client close log_type=[%d]\n", kName, log_type);
-            return;
-        } else { /* without a link that takes them, bytes are lost */
-            const log_link_use link{stream};
-            log_send_packet(link.fd(), link.ssl(), piece, static_cast<int>(n));
         }
     }
 }
