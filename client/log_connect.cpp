@@ -86,9 +86,10 @@ void log_failure(const server_name &name)
 }
 
 /* Connects the socket; false, after the log lines, when no try succeeded. */
-bool try_to_connect(int fd, const addrinfo &server, const server_name &name)
+bool try_to_connect(int fd, const addrinfo &server, const server_name &name, const log_link *link)
 {
-    for (int tries = 0; tries < g_daemon.retry_count; ++tries) {
+    const auto wanted = [link] { return link == nullptr || log_link_wanted(*link); };
+    for (int tries = 0; tries < g_daemon.retry_count && wanted(); ++tries) {
         if (connect(fd, server.ai_addr, server.ai_addrlen) == 0)
             return true;
         const int error = errno;
@@ -107,7 +108,7 @@ bool try_to_connect(int fd, const addrinfo &server, const server_name &name)
 
 } // namespace
 
-int log_connect_server(const char *host, int port, SSL **session)
+int log_connect_server(const char *host, int port, SSL **session, const log_link *link)
 {
     const address_list server = translate(host, port);
     if (!server)
@@ -122,7 +123,7 @@ int log_connect_server(const char *host, int port, SSL **session)
     name.port = port;
     render(*server, &name);
     LOG_NOTE("Trying to connect to address: %s, port: %d\n", name.address, port);
-    if (!try_to_connect(sock.get(), *server, name))
+    if (!try_to_connect(sock.get(), *server, name, link))
         return -1;
     if (vex_open_ssl(sock.get(), session) != 1) {
         log_failure(name);

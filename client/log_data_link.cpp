@@ -12,6 +12,7 @@
 #include "protocol/log_reassembly.h"
 
 #include <cerrno>
+#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <sys/socket.h>
@@ -70,6 +71,10 @@ void receive(const char *name, const log_link &link)
             LOG_NOTE("%s:recvcount=0,client close fd[%d]\n", name, link.fd);
             return;
         }
+        if (!log_link_stands()) {
+            LOG_NOTE("%s: the stream was stopped or started anew, what fd[%d] brought is dropped\n", name, link.fd);
+            return;
+        }
         LOG_NOTE("%s:recvbuf=%.*s\n", name, static_cast<int>(n), reinterpret_cast<const char *>(piece));
         log_proc_tcp_pkg(state, {piece, static_cast<std::size_t>(n)});
     }
@@ -90,6 +95,7 @@ void log_locally(const log_link &link)
 void log_recv_server_msg(const log_link &link)
 {
     LOG_NOTE("enter %s: fd=[%d]\n", __func__, link.fd);
+    log_link_serve(link);
     receive(__func__, link);
     {
         const log_producer_turn turn{link.stream};
@@ -107,7 +113,7 @@ void give_up(const log_link &link)
 }
 
 /* Announces a link that has just been connected, and serves it. */
-void serve(const char *body, log_link &link)
+void serve(const char *body, const log_link &link)
 {
     const bool wanted = log_link_record_session(link);
     const int announced = wanted ? announce(body, link) : -1;
@@ -124,44 +130,45 @@ void serve(const char *body, log_link &link)
     give_up(link);
 }
 
-void run_link(const char *body, log_stream stream)
+void run_link(const char *body, log_stream stream, const void *argument)
 {
     LOG_NOTE("enter %s.\n", body);
-    log_link link = log_link_begin(stream);
-    link.fd = log_connect_server(link.target.ip, link.target.port, &link.ssl);
+    log_link link{.stream = stream, .start = static_cast<unsigned>(reinterpret_cast<std::uintptr_t>(argument))};
+    if (log_link_begin(link))
+        link.fd = log_connect_server(link.target.ip, link.target.port, &link.ssl, &link);
     if (link.fd != -1)
         serve(body, link);
-    log_link_end(stream);
+    log_link_end(link);
 }
 
-void *log_client_syslog_thread_proc(void *)
+void *log_client_syslog_thread_proc(void *start)
 {
-    run_link(__func__, log_stream::syslog);
+    run_link(__func__, log_stream::syslog, start);
     return nullptr;
 }
 
-void *log_client_qxdm_thread_proc(void *)
+void *log_client_qxdm_thread_proc(void *start)
 {
-    run_link(__func__, log_stream::qxdm);
+    run_link(__func__, log_stream::qxdm, start);
     return nullptr;
 }
 
-int start(const char *starter, void *(*body)(void *), log_stream stream)
+int start_link(const char *starter, void *(*body)(void *), log_stream stream, unsigned start)
 {
-    const int result = log_start_thread(starter, body);
+    const int result = log_start_thread(starter, body, reinterpret_cast<void *>(std::uintptr_t{start}));
     if (result != 0)
-        log_link_end(stream);
+        log_link_end({.stream = stream, .start = start});
     return result;
 }
 
 } // namespace
 
-int vex_log_client_syslog_thread()
+int vex_log_client_syslog_thread(unsigned start)
 {
-    return start(__func__, log_client_syslog_thread_proc, log_stream::syslog);
+    return start_link(__func__, log_client_syslog_thread_proc, log_stream::syslog, start);
 }
 
-int vex_log_client_qxdm_thread()
+int vex_log_client_qxdm_thread(unsigned start)
 {
-    return start(__func__, log_client_qxdm_thread_proc, log_stream::qxdm);
+    return start_link(__func__, log_client_qxdm_thread_proc, log_stream::qxdm, start);
 }

@@ -7,8 +7,9 @@
 #define CLIENT_LOG_DATA_LINK_H
 
 /* Start the thread of a stream's data link, which connects to the target that log_stream_start() has recorded, announces
- * itself and reads until the link ends. 0 started, -1 not (logged). For any thread. */
-int vex_log_client_syslog_thread();
-int vex_log_client_qxdm_thread();
+ * itself and reads until the link ends. `start` is the number that log_stream_start() gave. 0 started, -1 not (logged).
+ * For any thread. */
+int vex_log_client_syslog_thread(unsigned start);
+int vex_log_client_qxdm_thread(unsigned start);
 
 #endif

@@ -16,6 +16,7 @@
  *   g_registry_lock  the fields of the registry. Held for a few instructions: no waiting for a peer, sending, logging
  *                    or starting of threads and programs
  *   g_block_lock     the blocks that wait for their next use (core/log_block.h); as short
+ *   g_restart_lock   the latest restart of the local system log (core/log_local_syslog.cpp); as short
  *   g_context_lock   the TLS context (client/log_tls.cpp), and
  *   a session's own  one library call on it (client/tls_session.cpp): both are taken last
  */

@@ -21,13 +21,15 @@ struct stream_state {
     log_mutex producer_lock;
     log_mutex send_lock; /* one send at a time on the data link */
 
-    int link_threads LOG_GUARDED_BY(g_registry_lock) = 0;         /* that run or are about to */
-    unsigned stops LOG_GUARDED_BY(g_registry_lock) = 0;           /* so many times stopped */
-    unsigned last_serial LOG_GUARDED_BY(g_registry_lock) = 0;     /* of the latest link, whether it stands or not */
-    unsigned producer_serial LOG_GUARDED_BY(g_registry_lock) = 0; /* of the link that the latest producer was for */
-    std::atomic<int> sending_fd{-1}; /* the link, or one before, that a send is under way on */
+    unsigned starts LOG_GUARDED_BY(g_registry_lock) = 0;         /* so many there have been */
+    unsigned wanted LOG_GUARDED_BY(g_registry_lock) = 0;         /* the latest start; 0 once it was stopped */
+    unsigned link_start LOG_GUARDED_BY(g_registry_lock) = 0;     /* of the link that stands; 0: none */
+    unsigned producer_start LOG_GUARDED_BY(g_registry_lock) = 0; /* of the link that the latest producer was for */
     int intakes_starting LOG_GUARDED_BY(g_registry_lock) = 0;
-    int intake_fd LOG_GUARDED_BY(g_registry_lock) = -1; /* where an intake waits for the producer */
+    unsigned intake_start LOG_GUARDED_BY(g_registry_lock) = 0; /* of the intake that waits for its producer, */
+    int intake_fd LOG_GUARDED_BY(g_registry_lock) = -1;        /* and where it does */
+
+    std::atomic<int> sending_fd{-1}; /* the link, or one before, that a send is under way on */
 };
 
 struct stream_fields {
@@ -69,6 +71,7 @@ SSL *&link_ssl(log_stream stream) LOG_REQUIRES(g_registry_lock)
  * done. What is still to be sent goes out: it is the owner who knows whether a sender is to be woken, too. */
 void take_away(log_stream stream) LOG_REQUIRES(g_registry_lock)
 {
+    state_of(stream).link_start = 0;
     link_ssl(stream) = nullptr;
     if (const int fd = std::exchange(link_fd(stream), -1); fd != -1)
         shutdown(fd, SHUT_RD);
@@ -86,10 +89,7 @@ void close_local(log_stream stream) LOG_REQUIRES(g_registry_lock)
         close(fd);
 }
 
-bool stopped(const log_link &link) LOG_REQUIRES(g_registry_lock)
-{
-    return state_of(link.stream).stops != link.stops;
-}
+thread_local const log_link *t_served; /* the data link that this thread serves */
 
 } // namespace
 
@@ -97,66 +97,97 @@ log_producer_turn::log_producer_turn(log_stream stream) : hold_(state_of(stream)
 
 log_producer_turn::~log_producer_turn() = default;
 
-void log_stream_start(log_stream stream, const char *ip, int port)
+unsigned log_stream_start(log_stream stream, const char *ip, int port)
 {
     const log_lock hold{g_registry_lock};
     log_target &target = *fields_of(stream).target;
     std::strncpy(target.ip, ip, sizeof target.ip - 1); /* clears the rest */
     target.port = port;
-    ++state_of(stream).link_threads;
+    return state_of(stream).wanted = ++state_of(stream).starts;
 }
 
 void log_stream_stop(log_stream stream)
 {
     const log_lock hold{g_registry_lock};
-    ++state_of(stream).stops;
+    state_of(stream).wanted = 0;
     take_away(stream);
     close_local(stream);
     send_intake_home(stream);
 }
 
-log_link log_link_begin(log_stream stream)
+void log_stream_taken_elsewhere(log_stream stream)
 {
     const log_lock hold{g_registry_lock};
-    return {.stream = stream, .target = *fields_of(stream).target, .stops = state_of(stream).stops};
+    state_of(stream).producer_start = state_of(stream).starts + 1;
 }
 
-bool log_link_record_session(log_link &link)
+void log_streams_shut_down()
 {
     const log_lock hold{g_registry_lock};
-    if (stopped(link))
+    for (const log_stream stream : {log_stream::syslog, log_stream::qxdm})
+        if (link_fd(stream) != -1)
+            shutdown(link_fd(stream), SHUT_RDWR);
+}
+
+bool log_link_begin(log_link &link)
+{
+    const log_lock hold{g_registry_lock};
+    link.target = *fields_of(link.stream).target;
+    return state_of(link.stream).wanted == link.start;
+}
+
+bool log_link_wanted(const log_link &link)
+{
+    const log_lock hold{g_registry_lock};
+    return state_of(link.stream).wanted == link.start;
+}
+
+bool log_link_record_session(const log_link &link)
+{
+    const log_lock hold{g_registry_lock};
+    if (state_of(link.stream).wanted != link.start)
         return false;
     take_away(link.stream);
     link_ssl(link.stream) = link.ssl;
-    link.serial = ++state_of(link.stream).last_serial;
+    state_of(link.stream).link_start = link.start;
     return true;
 }
 
 bool log_link_record(const log_link &link)
 {
     const log_lock hold{g_registry_lock};
-    if (stopped(link) || state_of(link.stream).last_serial != link.serial)
+    if (state_of(link.stream).wanted != link.start)
         return false;
     link_fd(link.stream) = link.fd;
     return true;
 }
 
+void log_link_serve(const log_link &link)
+{
+    t_served = &link;
+}
+
+bool log_link_stands()
+{
+    const log_lock hold{g_registry_lock};
+    return t_served == nullptr || state_of(t_served->stream).link_start == t_served->start;
+}
+
 void log_link_close(const log_link &link)
 {
     stream_state &state = state_of(link.stream);
-    bool sending = false;
     {
         const log_lock hold{g_registry_lock};
-        if (state.last_serial == link.serial && !stopped(link)) {
+        if (state.link_start == link.start) {
+            state.link_start = 0;
             link_fd(link.stream) = -1;
             link_ssl(link.stream) = nullptr;
             close_local(link.stream);
         }
-        sending = state.sending_fd == link.fd;
     }
-    if (sending) {
+    if (state.sending_fd == link.fd) {
         shutdown(link.fd, SHUT_RDWR); /* wakes a sender that a stalled server blocks */
-        const log_lock until_sent{state.send_lock};
+        state.sending_fd.wait(link.fd);
     }
     if (g_daemon.use_ssl == 1)
         g_daemon.close_ssl(link.ssl, 0);
@@ -167,21 +198,21 @@ void log_link_close(const log_link &link)
 bool log_link_is_latest(const log_link &link)
 {
     const log_lock hold{g_registry_lock};
-    return state_of(link.stream).producer_serial <= link.serial;
+    return state_of(link.stream).producer_start <= link.start;
 }
 
-void log_link_end(log_stream stream)
+void log_link_end(const log_link &link)
 {
     const log_lock hold{g_registry_lock};
-    if (--state_of(stream).link_threads == 0)
-        send_intake_home(stream);
+    if (state_of(link.stream).intake_start == link.start)
+        send_intake_home(link.stream);
 }
 
 int log_link_for_producer(log_stream stream)
 {
     const log_lock hold{g_registry_lock};
     if (link_fd(stream) != -1)
-        state_of(stream).producer_serial = state_of(stream).last_serial;
+        state_of(stream).producer_start = state_of(stream).link_start;
     return link_fd(stream);
 }
 
@@ -202,7 +233,8 @@ log_link_use::log_link_use(log_stream stream) : stream_(stream), sending_(state_
 
 log_link_use::~log_link_use()
 {
-    state_of(stream_).sending_fd.store(-1, std::memory_order_release); /* seen late, it makes the owner wait in vain */
+    state_of(stream_).sending_fd = -1;
+    state_of(stream_).sending_fd.notify_all(); /* the owner, who may be waiting to close the link */
 }
 
 void log_intake_starting(log_stream stream)
@@ -223,10 +255,12 @@ bool log_intake_listens(log_stream stream, int fd)
     bool wanted = false;
     {
         const log_lock hold{g_registry_lock};
+        stream_state &state = state_of(stream);
         send_intake_home(stream); /* nobody can reach it any more: the path is another's now */
-        wanted = fd != -1 && state_of(stream).link_threads > 0;
-        state_of(stream).intake_fd = wanted ? fd : -1;
-        --state_of(stream).intakes_starting;
+        wanted = fd != -1 && state.wanted != 0;
+        state.intake_fd = wanted ? fd : -1;
+        state.intake_start = state.wanted;
+        --state.intakes_starting;
     }
     pthread_cond_broadcast(&g_intake_change);
     return wanted;

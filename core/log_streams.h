@@ -49,32 +49,44 @@ private:
 
 /* ---- Start and stop ---- */
 
-/* Records the target of a stream that is about to be started, and that a data-link thread will come for it: one that does
- * not come after all is to be taken back with log_link_end(). */
-void log_stream_start(log_stream stream, const char *ip, int port);
+/* Records the target of a stream that is being started; the number of the start, by which its link and its intake are
+ * known. They are wanted until the stream is stopped or started anew. */
+unsigned log_stream_start(log_stream stream, const char *ip, int port);
 
 /* Takes the data link away from its owner, closes our end of the intake's connection, and sends an intake home that still
- * waits. Links that have not come to stand yet will not. */
+ * waits. */
 void log_stream_stop(log_stream stream);
+
+/* A producer was started that has to do with no link: no ended link's thread may stop it. */
+void log_stream_taken_elsewhere(log_stream stream);
+
+/* Shuts both data links down, as the process is about to end: programs may hold copies of them. */
+void log_streams_shut_down();
 
 /* ---- The data link, for the thread that owns it ---- */
 
 struct log_link {
     log_stream stream;
-    log_target target;
-    unsigned stops; /* how often the stream had been stopped when the thread began */
+    unsigned start; /* the number of its start */
+    log_target target{};
     int fd = -1;
     SSL *ssl = nullptr;
-    unsigned serial = 0; /* later links have higher ones */
 };
 
-/* What the thread has to do. */
-log_link log_link_begin(log_stream stream);
+/* Reads what the thread has to do; false when its start is not wanted any more. */
+bool log_link_begin(log_link &link);
+
+/* Whether the start is still wanted, for a link that is not connected yet. */
+bool log_link_wanted(const log_link &link);
 
 /* Records the link's session, in place of a link that stood there; then, once the link can be used, its socket. False when
- * the stream was stopped meanwhile: the link is not to be used. */
-bool log_link_record_session(log_link &link);
+ * the start is not wanted any more: the link is not to be used. */
+bool log_link_record_session(const log_link &link);
 bool log_link_record(const log_link &link);
+
+/* Whether the link still stands, as far as the calling thread serves one. */
+void log_link_serve(const log_link &link);
+bool log_link_stands();
 
 /* Takes the link back if it still stands, waits until nobody sends on it, and closes it. */
 void log_link_close(const log_link &link);
@@ -82,8 +94,9 @@ void log_link_close(const log_link &link);
 /* Whether no producer has been started for a newer link yet: then what is run at this link's end hits none. */
 bool log_link_is_latest(const log_link &link);
 
-/* The thread's last step: an intake that waits for the stream's producer waits no longer when no thread is left. */
-void log_link_end(log_stream stream);
+/* The thread's last step, or the last when there is no thread: an intake that waits for the start's producer waits no
+ * longer. */
+void log_link_end(const log_link &link);
 
 /* ---- The data link, for others ---- */
 
@@ -118,8 +131,8 @@ private:
 void log_intake_starting(log_stream stream);
 void log_intake_await(log_stream stream);
 
-/* The intake listens on `fd`, in place of one that still waited there; -1: it could not be brought up. False when nobody
- * wants it any more. */
+/* The intake of the latest start listens on `fd`, in place of one that still waited there; -1: it could not be brought up.
+ * False when it is not wanted any more. */
 bool log_intake_listens(log_stream stream, int fd);
 
 /* The intake no longer waits on `fd`: true; false when it was sent home meanwhile. */

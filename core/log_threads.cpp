@@ -10,11 +10,11 @@ constexpr char kLogSource[] = "vex_log_manage";
 
 } // namespace
 
-int log_start_thread(const char *starter, void *(*entry)(void *))
+int log_start_thread(const char *starter, void *(*entry)(void *), void *argument)
 {
     log_thread_task task{};
     task.entry = entry;
-    if (log_thread_create(&task, nullptr) == 0)
+    if (log_thread_create(&task, argument) == 0)
         return 0;
     LOG_NOTE("%s  FAIL\n", starter);
     return -1;

@@ -3,8 +3,7 @@
 #ifndef CORE_LOG_THREADS_H
 #define CORE_LOG_THREADS_H
 
-/* Starts `entry` with a null argument. 0 started; -1 after a log line in the name of `starter`. For any
- * thread. */
-int log_start_thread(const char *starter, void *(*entry)(void *));
+/* Starts `entry` with the argument. 0 started; -1 after a log line in the name of `starter`. For any thread. */
+int log_start_thread(const char *starter, void *(*entry)(void *), void *argument = nullptr);
 
 #endif

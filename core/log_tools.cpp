@@ -50,15 +50,24 @@ int write_some(int fd, SSL *ssl, const char *bytes, int len)
     return static_cast<int>(send(fd, bytes, static_cast<std::size_t>(len), 0));
 }
 
-/* As system(), for a line whose program inherits a descriptor. */
-int run_shell_with(const char *cmdStr, int handed_fd)
+/* Starts a shell for the line, in a process group of its own or with a descriptor that its programs inherit; -1 on
+ * failure. */
+pid_t start_shell(const char *cmdStr, bool own_group, int handed_fd)
 {
     const pid_t shell = fork();
-    if (shell == 0) {
+    if (shell != 0)
+        return shell;
+    if (own_group)
+        setpgid(0, 0);
+    if (handed_fd != -1)
         fcntl(handed_fd, F_SETFD, 0);
-        execl("/bin/sh", "sh", "-c", cmdStr, nullptr);
-        _exit(127);
-    }
+    execl("/bin/sh", "sh", "-c", cmdStr, nullptr);
+    _exit(127);
+}
+
+/* Waits for the shell; its status as system() has it. */
+int await_shell(pid_t shell)
+{
     int status = -1;
     while (shell != -1 && waitpid(shell, &status, 0) == -1)
         if (errno != EINTR)
@@ -171,7 +180,15 @@ int log_exec_cmd(const char *cmdStr)
 int log_exec_cmd_with(const char *cmdStr, int handed_fd)
 {
     LOG_NOTE("cmdStr[%s]\n", cmdStr);
-    return judge_cmd(cmdStr, run_shell_with(cmdStr, handed_fd));
+    return judge_cmd(cmdStr, await_shell(start_shell(cmdStr, false, handed_fd)));
+}
+
+pid_t log_exec_cmd_apart(const char *cmdStr)
+{
+    LOG_NOTE("cmdStr[%s]\n", cmdStr);
+    const pid_t shell = start_shell(cmdStr, true, -1);
+    judge_cmd(cmdStr, await_shell(shell));
+    return std::max(shell, 0);
 }
 
 int vex_popen(const char *cmd, char *buffer, int size)

@@ -11,6 +11,7 @@
 #include <cstdint>
 #include <openssl/ossl_typ.h>
 #include <pthread.h>
+#include <sys/types.h>
 
 /* ---- Threads ---- */
 
@@ -50,6 +51,10 @@ int log_exec_cmd(const char *cmdStr);
 
 /* The same for a line whose program is told a descriptor by its number: it alone inherits `handed_fd`. */
 int log_exec_cmd_with(const char *cmdStr, int handed_fd);
+
+/* The same for a line whose programs are to be a process group of their own: the group's number; 0 when no shell could be
+ * run. */
+pid_t log_exec_cmd_apart(const char *cmdStr);
 
 /* Runs the shell command line and captures the first line of its output, without its newline and cut at size
  * - 1 characters, in `buffer` of `size` bytes, which is cleared first. 1 captured, 0 nothing to capture. */

@@ -7,6 +7,7 @@
 #include "core/log_local_syslog.h"
 #include "core/log_options.h"
 #include "core/log_process.h"
+#include "core/log_streams.h"
 #include "core/log_tools.h"
 #include "handlers/bsp_module_level.h"
 #include "protocol/json_memory.h"
@@ -102,6 +103,7 @@ int main(int argc, char **argv)
     else if (const int status = run_client_mode(); status != 0)
         return status;
     wait_for_exit();
+    log_streams_shut_down();
     std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
     _exit(0);            /* other threads still run: nothing that they use may be torn down */
 }

@@ -10,13 +10,13 @@ namespace
 {
 
 /* Opens the data link; over TLS, the intake first, so that it listens before the server can confirm the link. */
-void open_link(log_stream stream, const live_log_request &request, int (*start_intake)(), int (*start_link)())
+void open_link(log_stream stream, const live_log_request &request, int (*start_intake)(), int (*start_link)(unsigned))
 {
     const int port = log_text_to_int(request.port);
-    log_stream_start(stream, request.ip, port);
+    const unsigned start = log_stream_start(stream, request.ip, port);
     if (g_daemon.use_ssl == 1)
         start_intake();
-    start_link();
+    start_link(start);
     live_log_reply({"tcp", port, request.ip});
 }
 
@@ -40,8 +40,14 @@ void end_syslog()
 
 void start_modem(const live_log_request &request)
 {
-    if (live_log_prepare_modem())
-        open_link(log_stream::qxdm, request, vex_log_recv_qxdm_thread, vex_log_client_qxdm_thread);
+    {
+        const log_producer_turn turn{log_stream::qxdm};
+        if (!live_log_prepare_modem()) {
+            log_stream_taken_elsewhere(log_stream::qxdm);
+            return;
+        }
+    }
+    open_link(log_stream::qxdm, request, vex_log_recv_qxdm_thread, vex_log_client_qxdm_thread);
 }
 
 void end_modem()

@@ -41,6 +41,7 @@ stream_ends::stream_ends()
 void start_syslog(const stream_ends &ends)
 {
     g_daemon.syslog_realtime_on = 1;
+    log_break_off_local_syslog();
     log_exec_cmd("killall -9 syslogd");
     char cmd[256];
     std::snprintf(cmd, sizeof cmd, ends.peer_class == 2 ? "syslogd -R [%s]:%d &" : "syslogd -R %s:%d &", ends.client_ip,

@@ -1,5 +1,6 @@
 #include "core/daemon_state.h"
 #include "core/log_line.h"
+#include "core/log_local_syslog.h"
 #include "core/log_streams.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
@@ -24,6 +25,16 @@ bool is_for_this_device(const cJSON *link)
     return false;
 }
 
+/* Whether the data link that brought the confirmation still stands: else it would have a program started for the stream
+ * that comes after. What the control link brings is for whatever link there is. */
+bool came_in_time()
+{
+    if (log_link_stands())
+        return true;
+    LOG_NOTE("the data link was stopped before it was confirmed\n");
+    return false;
+}
+
 /* The socket that the stream's log program is to write to: over TLS, one that is connected to the stream's intake; else the
  * data link, which may be -1. -1 when there is no connection to the intake (logged). */
 int producer_socket(log_stream stream, int link_fd, const char *intake)
@@ -38,6 +49,8 @@ int producer_socket(log_stream stream, int link_fd, const char *intake)
 void start_syslog()
 {
     const log_producer_turn turn{log_stream::syslog};
+    if (!came_in_time())
+        return;
     const int link_fd = log_link_for_producer(log_stream::syslog);
     if (link_fd == -1)
         return;
@@ -47,6 +60,7 @@ void start_syslog()
     char cmd[256];
     std::snprintf(cmd, sizeof cmd, "syslogd -R tcp_fd=%d &", fd);
     LOG_NOTE("cmd=[%s]\n", cmd);
+    log_break_off_local_syslog();
     log_exec_cmd("killall -9 syslogd");
     log_exec_cmd_with(cmd, fd);
 }
@@ -54,6 +68,8 @@ void start_syslog()
 void start_modem()
 {
     const log_producer_turn turn{log_stream::qxdm};
+    if (!came_in_time())
+        return;
     log_exec_cmd("killall -9 diag_mdlog");
     if (!live_log_has_config())
         return;

@@ -53,7 +53,8 @@ protected:
         std::string why;
         pollfd entry{listener_.fd.get(), POLLIN, 0};
         EXPECT_EQ(1, poll(&entry, 1, kPatience));
-        std::optional<tool_call> call = tool_take_call(listener_, {}, why);
+        std::optional<tool_call> call =
+            tool_take_call(listener_, {}, tool_clock::now() + std::chrono::milliseconds(kPatience), why);
         EXPECT_TRUE(call && call->msgid == msgid) << why;
         return call;
     }
@@ -64,11 +65,11 @@ protected:
         const auto frame = tool_receive(*control_, std::chrono::milliseconds(kPatience), why);
         return frame ? frame->control : why;
     }
-    std::string ask(const stream &which, const char *action)
+    std::string ask(const stream &which, const char *action, const char *port = "5000")
     {
         return ask(
             tool_command("6", "realtimeLog",
-                         {{"LogType", which.log_type}, {"Action", action}, {"ip", "127.0.0.1"}, {"port", "5000"}}));
+                         {{"LogType", which.log_type}, {"Action", action}, {"ip", "127.0.0.1"}, {"port", port}}));
     }
     /* Starts a stream; its data link, which is not confirmed yet. */
     tool_link start(const stream &which)
@@ -256,6 +257,26 @@ TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
         }
         hang_up();
     }
+}
+
+TEST_F(Streams, BelongToTheLatestStart)
+{
+    install_program("killall", "[ $1 = -q ] && sleep 0.2\nexec /usr/vex/bin/killall \"$@\"");
+    call(false, 100000);
+    const resources rest = used();
+    ask(kSyslog, "start", "5001"); /* nobody is there, and when somebody comes, it is not tried any more */
+    tool_link first = start(kSyslog);
+    confirm(first, kSyslog);
+    EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5001"));
+    EXPECT_TRUE(take(first, 100000).first);
+    end(kSyslog);
+    tool_link second = start(kSyslog); /* not hit by the restart of the local log, which is still under way */
+    confirm(second, kSyslog);
+    const std::size_t for_a_while = std::size_t{500} << 20;
+    EXPECT_EQ(std::pair(true, for_a_while), take(second, for_a_while));
+    end(kSyslog);
+    EXPECT_TRUE(settles(rest));
+    hang_up();
 }
 
 TEST_F(Streams, AreConfirmedByTheDevicesOwnServerOnly)

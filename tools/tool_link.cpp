@@ -73,9 +73,8 @@ std::string silent(const tool_link &link, std::chrono::milliseconds limit, bool 
         return fact +
                ". Either it is still at work, then try again with a larger --reply-timeout, or it does not know the "
                "command: such a one it leaves unanswered";
-    if (link.held.empty() && limit != link.limits.stall)
-        return fact;
-    return fact + " in the middle of an answer. Try again, or with a larger --stall-timeout";
+    return fact + (link.held.empty() && link.called ? "" : " in the middle of an answer") +
+           ". Try again, or with a larger --stall-timeout";
 }
 
 /* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are none. */
@@ -186,11 +185,20 @@ std::optional<tool_link> tool_connect(const std::string &host, const std::string
             continue;
         const int on = 1;
         setsockopt(sock.get(), IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
-        setsockopt(sock.get(), SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
+        tool_set_keepalive(sock.get());
         return tool_link{.fd = std::move(sock), .where = where, .limits = limits, .held = {}};
     }
     why = error == kInterrupted ? error : "cannot connect to " + where + ": " + error + advice;
     return std::nullopt;
+}
+
+void tool_set_keepalive(int fd)
+{
+    const std::pair<int, int> settings[] = {{TCP_KEEPIDLE, 60}, {TCP_KEEPINTVL, 10}, {TCP_KEEPCNT, 3}};
+    const int on = 1;
+    setsockopt(fd, SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on);
+    for (const auto &[name, value] : settings)
+        setsockopt(fd, IPPROTO_TCP, name, &value, sizeof value);
 }
 
 std::string tool_address(int fd, decltype(getsockname) *end)

@@ -44,6 +44,9 @@ struct tool_frame {
 std::optional<tool_link> tool_connect(const std::string &host, const std::string &port, const tool_limits &limits,
                                       const char *advice, std::string &why);
 
+/* Has a device that is gone without a word found out after 90 seconds of silence. */
+void tool_set_keepalive(int fd);
+
 /* The address of an end of a connection, getsockname or getpeername; of an IPv4 one as such, whatever the socket. */
 std::string tool_address(int fd, decltype(getsockname) *end);
 

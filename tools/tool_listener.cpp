@@ -2,6 +2,7 @@
 
 #include "tools/tool_answer.h"
 
+#include <algorithm>
 #include <arpa/inet.h>
 #include <cerrno>
 #include <cstring>
@@ -10,8 +11,6 @@
 
 namespace
 {
-
-constexpr auto kAnnouncement = std::chrono::seconds(30); /* a device that calls says at once who it is */
 
 /* A socket that listens at the address; none, and errno, on failure. */
 unique_fd listen_at(const sockaddr *address, socklen_t len)
@@ -22,7 +21,7 @@ unique_fd listen_at(const sockaddr *address, socklen_t len)
     const int on = 1;
     const int off = 0;
     setsockopt(sock.get(), SOL_SOCKET, SO_REUSEADDR, &on, sizeof on);
-    setsockopt(sock.get(), SOL_SOCKET, SO_KEEPALIVE, &on, sizeof on); /* what it accepts inherits it */
+    tool_set_keepalive(sock.get()); /* what it accepts inherits it */
     if (address->sa_family == AF_INET6)
         setsockopt(sock.get(), IPPROTO_IPV6, IPV6_V6ONLY, &off, sizeof off);
     if (bind(sock.get(), address, len) != 0 || listen(sock.get(), 8) != 0)
@@ -50,8 +49,13 @@ bool tool_listen(tool_listener &listener, std::string &why)
     return static_cast<bool>(listener.fd);
 }
 
-std::optional<tool_call> tool_take_call(const tool_listener &listener, const tool_limits &limits, std::string &why)
+std::optional<tool_call> tool_take_call(const tool_listener &listener, const tool_limits &limits,
+                                        tool_clock::time_point end, std::string &why)
 {
+    const auto left = [end](std::chrono::milliseconds limit) {
+        const auto all = std::chrono::ceil<std::chrono::milliseconds>(end - tool_clock::now());
+        return std::clamp(all, std::chrono::milliseconds(0), limit);
+    };
     unique_fd fd{accept4(listener.fd.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK)};
     if (!fd) {
         why = std::string("cannot accept a call: ") + std::strerror(errno);
@@ -59,11 +63,11 @@ std::optional<tool_call> tool_take_call(const tool_listener &listener, const too
     }
     tool_call call{.link = tool_called_link(std::move(fd), limits), .announcement = nullptr, .msgid = {}};
     if (listener.context && !(call.link.session = tool_tls_accept(listener.context.get(), call.link.fd.get(),
-                                                                  tool_clock::now() + limits.connect, why))) {
+                                                                  tool_clock::now() + left(limits.connect), why))) {
         why = call.link.where + " called, but " + why;
         return std::nullopt;
     }
-    const std::optional<tool_frame> frame = tool_receive(call.link, kAnnouncement, why);
+    const std::optional<tool_frame> frame = tool_receive(call.link, left(limits.stall), why);
     if (!frame) {
         why = call.link.where + " called, but did not say who it is: " + why;
         return std::nullopt;

@@ -17,14 +17,16 @@ struct tool_listener {
 /* Listens on a port of every address that this machine has; false, and why, when that cannot be. */
 bool tool_listen(tool_listener &listener, std::string &why);
 
-/* Takes a call that is there, shakes hands and receives the frame by which a caller begins. None, and why, when there is
- * no talking to the caller. */
 struct tool_call {
     tool_link link;
     json_tree announcement;
     std::string msgid;
 };
-std::optional<tool_call> tool_take_call(const tool_listener &listener, const tool_limits &limits, std::string &why);
+
+/* Takes a call that is there, shakes hands and receives the frame by which a caller begins, all before `end`. None, and
+ * why, when there is no talking to the caller. */
+std::optional<tool_call> tool_take_call(const tool_listener &listener, const tool_limits &limits,
+                                        tool_clock::time_point end, std::string &why);
 
 /* The printable text of a member of the object `group` in what a caller announced. */
 std::string tool_announced(const tool_call &call, const char *group, const char *name);

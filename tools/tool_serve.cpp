@@ -63,7 +63,7 @@ bool await_device(tool_device &device, const tool_listener &listener, input_line
         if (!called)
             continue;
         std::string why;
-        std::optional<tool_call> call = tool_take_call(listener, device.limits, why);
+        std::optional<tool_call> call = tool_take_call(listener, device.limits, tool_clock::now() + kForEver, why);
         if (call && call->msgid != "9")
             why = call->link.where + " called, but not to be served: it announced a link of another kind";
         if (!why.empty()) {

@@ -52,7 +52,7 @@ bool write_patiently(int fd, std::string_view bytes, std::string &why)
 /* How a stream ended. */
 struct stream_result {
     std::uint64_t bytes = 0;
-    bool over = false;        /* at its own end */
+    bool over = false;        /* at its own end, or told to end */
     bool device_lost = false; /* another tool has it, or it is gone */
     std::string why;          /* when it was not the user who ended it */
 };
@@ -71,7 +71,7 @@ std::string lost(const tool_link &link)
 void relay(tool_link &control, tool_stream_source &source, const stream_output &out, tool_clock::time_point end,
            stream_result &result)
 {
-    auto told = std::min<tool_clock::time_point>(end, tool_clock::now() + kFirstBytes);
+    auto told = result.over ? end : std::min<tool_clock::time_point>(end, tool_clock::now() + kFirstBytes);
     for (;;) {
         std::string bytes;
         short wanted = 0;
@@ -100,6 +100,7 @@ void relay(tool_link &control, tool_stream_source &source, const stream_output &
 void drain(tool_link &control, tool_stream_source &source, const stream_output &out, stream_result &result)
 {
     stream_result rest;
+    rest.over = true;
     relay(control, source, out, tool_clock::now() + control.limits.stall, rest);
     result.bytes += rest.bytes;
 }

@@ -54,6 +54,32 @@ bool confirm(tool_call &call, const char *connect_type, std::string &why)
                      why);
 }
 
+/* Whether a call is the stream's data link, and can still be; else it is told of. */
+bool is_for(const std::optional<tool_call> &call, const tool_device &device, const char *connect_type,
+            const std::string &wrong)
+{
+    if (!call)
+        std::fprintf(stderr, "%s\n", wrong.c_str());
+    else if (tool_announced(*call, "DataLink", "ConnectType") != connect_type ||
+             tool_announced(*call, "DataLink", "imei") != device.imei)
+        std::fprintf(stderr, "%s called, but not for this stream\n", call->link.where.c_str());
+    else
+        return true;
+    return false;
+}
+
+/* Why no data link has come. */
+std::string not_called(const tool_device &device, tool_wait event)
+{
+    if (event == tool_wait::interrupted)
+        return "interrupted";
+    if (event == tool_wait::ready)
+        return "the device has hung up";
+    return "the device said that it streams, but did not call for it within " + tool_seconds(device.limits.reply) +
+           ". Can it reach " + tool_address(device.link->fd.get(), getsockname) + " port " + device.called_at->port +
+           "?";
+}
+
 /* Waits for the data link that the device makes for the stream, and confirms it. */
 std::optional<tool_link> await_data_link(tool_device &device, const std::string &log, std::string &why)
 {
@@ -63,27 +89,26 @@ std::optional<tool_link> await_data_link(tool_device &device, const std::string 
         pollfd sockets[] = {{device.called_at->fd.get(), POLLIN, 0}, {device.link->fd.get(), POLLIN, 0}};
         const tool_wait event = tool_wait_for(sockets, end);
         if (event != tool_wait::ready || (sockets[1].revents != 0 && !tool_still_there(*device.link))) {
-            why = event == tool_wait::interrupted ? "interrupted"
-                  : event == tool_wait::timeout
-                      ? "the device said that it streams, but did not call for it within " +
-                            tool_seconds(device.limits.reply) + ". Can it reach " +
-                            tool_address(device.link->fd.get(), getsockname) + " port " + device.called_at->port + "?"
-                      : "the device has hung up";
+            why = not_called(device, event);
             return std::nullopt;
         }
         if (sockets[0].revents == 0)
             continue;
         std::string wrong;
-        std::optional<tool_call> call = tool_take_call(*device.called_at, device.limits, wrong);
-        if (call && tool_announced(*call, "DataLink", "ConnectType") == connect_type &&
-            tool_announced(*call, "DataLink", "imei") == device.imei) {
-            if (confirm(*call, connect_type, why))
-                return std::move(call->link);
-            return std::nullopt;
-        }
-        std::fprintf(stderr, "%s\n",
-                     call ? (call->link.where + " called, but not for this stream").c_str() : wrong.c_str());
+        std::optional<tool_call> call = tool_take_call(*device.called_at, device.limits, end, wrong);
+        if (!is_for(call, device, connect_type, wrong))
+            continue;
+        if (confirm(*call, connect_type, wrong))
+            return std::move(call->link);
+        std::fprintf(stderr, "%s\n", wrong.c_str()); /* of an earlier stream, perhaps: another link may come */
     }
+}
+
+/* Hangs up on those that wait: data links of streams that were broken off, which would be taken for the next one's. */
+void clear_calls(const tool_listener &listener)
+{
+    while (unique_fd{accept4(listener.fd.get(), nullptr, nullptr, SOCK_CLOEXEC)})
+        continue;
 }
 
 std::string start_command(const tool_device &device, const std::string &log)
@@ -132,6 +157,8 @@ tool_stream_start tool_stream_begin(tool_device &device, const std::string &log,
     const bool datagrams = log == "syslog" && device.called_at == nullptr;
     if (datagrams && !(source.datagrams = open_datagrams(*device.link, state.why)))
         return state;
+    if (device.called_at != nullptr)
+        clear_calls(*device.called_at);
     state.asked = true;
     const std::optional<tool_answer> answer = tool_exchange(device, start_command(device, log), {}, state.why);
     state.answered = answer.has_value();
