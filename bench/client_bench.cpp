@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
+#include <fstream>
 #include <netinet/in.h>
 #include <sys/socket.h>
 
@@ -23,7 +24,8 @@ constexpr auto kPatience = std::chrono::seconds(10);
     std::exit(1);
 }
 
-/* A receive buffer of one size for all: the kernel's own choice, made anew for each connection, may double the speed. */
+/* A receive buffer of one size for all: the kernel's own choice, made anew for each connection, may double the
+ * speed. */
 void fix_window(int fd)
 {
     const int size = 1 << 20;
@@ -73,18 +75,24 @@ tls_link accept_call(const log_server &server)
     return link;
 }
 
+/* Reads a frame, with nothing behind it. */
+void read_frame(const tls_link &link)
+{
+    std::string frame;
+    char piece[2000];
+    while (!frame.ends_with("~#")) {
+        const ssize_t n = link.read(piece, sizeof piece);
+        if (n <= 0)
+            give_up("frame");
+        frame.append(piece, static_cast<std::size_t>(n));
+    }
+}
+
 /* The device's link, its announcement read. */
 tls_link accept_device(const log_server &server)
 {
     tls_link link = accept_call(server);
-    std::string announcement;
-    char piece[2000];
-    while (!announcement.ends_with("~#")) {
-        const ssize_t n = link.read(piece, sizeof piece);
-        if (n <= 0)
-            give_up("announcement");
-        announcement.append(piece, static_cast<std::size_t>(n));
-    }
+    read_frame(link);
     return link;
 }
 
@@ -106,8 +114,9 @@ struct sending_cost {
 };
 
 /*
- * Takes a session's records off its socket until they have brought so many bytes. They are not decrypted, which would cost more than all that the sender does but the same for every
- * sender: the session cannot be read from any more.
+ * Takes a session's records off its socket until they have brought so many bytes. They are not decrypted, which
+ * would cost more than all that the sender does but the same for every sender: the session cannot be read from any
+ * more.
  */
 sending_cost take_records(const tls_link &link, std::size_t content, pid_t sender)
 {
@@ -187,24 +196,13 @@ void measure_archive(const log_server &server, const char *floor_client)
 
 constexpr std::size_t kLogSize = 64 << 20;
 constexpr char kFloorSocket[] = "/tmp/floor.sock";
+constexpr char kCert[] = "/usr/vex/vex_conf/logcert/logclient_cert.crt";
+constexpr char kKey[] = "/usr/vex/vex_conf/logcert/logkey.pem";
 
-std::string stream_command(const char *action)
+std::string stream_command(const std::string &action)
 {
-    return make_frame(std::string(R"({"msgid":"6","realtimeLog":{"LogType":"syslog","Action":")") + action +
+    return make_frame(R"({"msgid":"6","realtimeLog":{"LogType":"syslog","Action":")" + action +
                       R"(","ip":"127.0.0.1","port":"5000"}})");
-}
-
-/* Reads one frame's worth of an answer that is known to be a frame. */
-void await_answer(const tls_link &link)
-{
-    std::string answer;
-    char piece[2000];
-    while (!answer.ends_with("~#")) {
-        const ssize_t n = link.read(piece, sizeof piece);
-        if (n <= 0)
-            give_up("answer");
-        answer.append(piece, static_cast<std::size_t>(n));
-    }
 }
 
 /* The daemon: a start, the log, an end. */
@@ -212,11 +210,11 @@ sending_cost relay_by_daemon(const log_server &server, const tls_link &control, 
 {
     control.write(stream_command("start"));
     const tls_link link = accept_device(server);
-    await_answer(control);
+    read_frame(control);
     link.write(make_frame(R"({"msgid":"10","DataLink":{"imei":"356938035643809","ConnectType":"syslog_connect"}})"));
     const sending_cost cost = take_records(link, kLogSize, daemon);
     control.write(stream_command("end"));
-    await_answer(control);
+    read_frame(control);
     return cost;
 }
 
@@ -230,47 +228,55 @@ sending_cost relay_by(const log_server &server, const std::vector<std::string> &
     return take_records(link, kLogSize, relay.pid());
 }
 
+/* Puts the feeder in the place of the device's system log program, and writes stunnel's configuration. */
+void prepare_relays(const char *feeder, int write_size)
+{
+    shell((std::string("cp --remove-destination ") + feeder + " /usr/vex/override/syslogd").c_str());
+    shell("head -c 1048576 /dev/urandom >/tmp/feed");
+    std::ofstream("/tmp/feed.times") << kLogSize / (1 << 20);
+    std::ofstream("/tmp/feed.size") << write_size;
+    std::ofstream("/tmp/stunnel.conf") << "foreground=yes\npid=\n[relay]\nclient=yes\naccept=" << kFloorSocket
+                                       << "\nconnect=127.0.0.1:" << kPort << "\ncert=" << kCert << "\nkey=" << kKey
+                                       << '\n';
+}
+
+/* What the daemon is measured beside. */
+struct rival {
+    const char *name;
+    std::vector<std::string> words;
+    paired_rounds speed{};
+    paired_rounds processor{};
+};
+
 void measure_relay(const log_server &server, const std::string &floor_client, const char *feeder, int write_size)
 {
-    const std::string certs = "/usr/vex/vex_conf/logcert/";
-    const std::vector<std::string> relays[] = {
-        {floor_client, "relay", std::to_string(kPort), kFloorSocket},
-        {"stunnel", "/tmp/stunnel.conf"},
-        {"socat", "-u", std::string("UNIX-LISTEN:") + kFloorSocket,
-         "OPENSSL:127.0.0.1:5000,verify=0,cert=" + certs + "logclient_cert.crt,key=" + certs + "logkey.pem"}};
-    const char *const names[] = {"plain program", "stunnel", "socat"};
-    shell((std::string("cp ") + feeder +
-           " /usr/vex/override/syslogd; head -c 1048576 /dev/urandom >/tmp/feed; "
-           "echo 64 >/tmp/feed.times; echo " +
-           std::to_string(write_size) +
-           " >/tmp/feed.size; "
-           "printf 'foreground=yes\\npid=\\n[relay]\\nclient=yes\\naccept=/tmp/floor.sock\\nconnect=127.0.0.1:5000\\n"
-           "cert=" +
-           certs + "logclient_cert.crt\\nkey=" + certs + "logkey.pem\\n' >/tmp/stunnel.conf")
-              .c_str());
-    paired_rounds speed[3];
-    paired_rounds processor[3];
+    const std::string port = std::to_string(kPort);
+    const std::string to_server = "OPENSSL:127.0.0.1:" + port + ",verify=0,cert=" + kCert + ",key=" + kKey;
+    rival rivals[] = {{"plain program", {floor_client, "relay", port, kFloorSocket}},
+                      {"stunnel", {"stunnel", "/tmp/stunnel.conf"}},
+                      {"socat", {"socat", "-u", std::string("UNIX-LISTEN:") + kFloorSocket, to_server}}};
     long peak = 0;
+    prepare_relays(feeder, write_size);
     for (int i = 0; i < kProcesses; ++i) {
-        const program daemon_process({"vex_log_manage", "-a", "127.0.0.1", "-p", std::to_string(kPort)});
+        const program daemon({"vex_log_manage", "-a", "127.0.0.1", "-p", port});
         const tls_link control = accept_device(server);
-        for (std::size_t j = 0; j < 3; ++j)
-            for (int round = 0; round < kRounds; ++round) {
-                const sending_cost floor = relay_by(server, relays[j], feeder);
-                const sending_cost ours = relay_by_daemon(server, control, daemon_process.pid());
-                speed[j].add(
+        for (int j = 0; j < kRounds; ++j)
+            for (rival &other : rivals) {
+                const sending_cost floor = relay_by(server, other.words, feeder);
+                const sending_cost ours = relay_by_daemon(server, control, daemon.pid());
+                other.speed.add(
                     1, [&] { return ours.seconds; }, [&] { return floor.seconds; });
-                processor[j].add(
+                other.processor.add(
                     1, [&] { return ours.processor; }, [&] { return floor.processor; });
             }
-        peak = std::max(peak, peak_kib(daemon_process.pid()));
+        peak = std::max(peak, peak_kib(daemon.pid()));
     }
-    for (std::size_t j = 0; j < 3; ++j) {
-        const comparison s = speed[j].medians();
+    for (const rival &other : rivals) {
+        const comparison s = other.speed.medians();
         std::printf(
-            "relay of writes of %4d bytes   %8.0f MB/s   %-17s%8.0f MB/s   ratio %.3f   its processor time %.3f\n",
-            write_size, kLogSize / s.daemon / 1e6, names[j], kLogSize / s.floor / 1e6, 1 / s.ratio,
-            processor[j].medians().ratio);
+            "relay of writes of %4d bytes   %8.0f MB/s   %-17s%8.0f MB/s   ratio %.3f, of processor time %.3f\n",
+            write_size, kLogSize / s.daemon / 1e6, other.name, kLogSize / s.floor / 1e6, 1 / s.ratio,
+            other.processor.medians().ratio);
     }
     std::printf("  the daemon's peak memory     %8ld KiB\n", peak);
 }

@@ -1,6 +1,6 @@
 /*
- * The floors of client mode: each calls a log server over TLS with the device's certificates, and then does with blocking
- * calls, one after the other, what it is there for.
+ * The floors of client mode: each calls a log server over TLS with the device's certificates, and then does with
+ * blocking calls, one after the other, what it is there for.
  *
  *   floor_client archive PORT FILE    sends a file as frames of 51200 bytes for each command that it reads
  *   floor_client relay PORT PATH      sends on what a program writes to a local socket

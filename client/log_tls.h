@@ -1,6 +1,6 @@
 /*
- * TLS towards the log server: the context that all links share, one session for each link, and the check of the server's
- * certificate. Log lines bear the source "vex_log_manage".
+ * TLS towards the log server: the context that all links share, one session for each link, and the check of the
+ * server's certificate. Log lines bear the source "vex_log_manage".
  */
 #ifndef CLIENT_LOG_TLS_H
 #define CLIENT_LOG_TLS_H
@@ -18,8 +18,9 @@ enum class log_tls_result {
  * is logged. Start-up calls it before any other thread exists. */
 log_tls_result log_tls_start();
 
-/* Opens a session on a connected socket, which it makes non-blocking, and checks the server: within 30 seconds, or it has
- * failed. 1, and the session in `*session`, or TLS is off; 0 failed (logged), and null in `*session`. For any thread. */
+/* Opens a session on a connected socket, which it makes non-blocking, and checks the server: within 30 seconds, or
+ * it has failed. 1, and the session in `*session`, or TLS is off; 0 failed (logged), and null in `*session`. For any
+ * thread. */
 int vex_open_ssl(int fd, SSL **session);
 
 /* 1 when the server's certificate is accepted, and says whose it is; 0 when not (logged). */

@@ -1,6 +1,6 @@
 /*
- * OpenSSL, loaded when client mode begins. Server mode, which has no use for it, is thereby spared the megabyte that the
- * library takes up by being there. Only calls that version 1.1 has too.
+ * OpenSSL, loaded when client mode begins. Server mode, which has no use for it, is thereby spared the megabyte that
+ * the library takes up by being there. Only calls that version 1.1 has too.
  */
 #ifndef CLIENT_TLS_LIBRARY_H
 #define CLIENT_TLS_LIBRARY_H

@@ -128,8 +128,8 @@ enum class session_wait {
     until_shaken /* hands: nobody else uses the session yet */
 };
 
-/* What a call that had no result waits for, or why it failed. The thread's error queue, by which the library tells that,
- * is empty before and after: to empty it before each call would cost more than all else that is done here. */
+/* What a call that had no result waits for, or why it failed. The thread's error queue, by which the library tells
+ * that, is empty before and after: to empty it before each call would cost more than all else that is done here. */
 int what_is_wanted(SSL *session, int result)
 {
     const int error = errno;

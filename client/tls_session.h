@@ -1,10 +1,10 @@
 /*
- * A TLS session that one thread reads while others write. A lock of its own is held across one library call at a time;
- * all waiting is done without it, so that a reader who waits never holds up a writer, nor the other way round.
+ * A TLS session that one thread reads while others write. A lock of its own is held across one library call at a
+ * time; all waiting is done without it, so that a reader who waits never holds up a writer, nor the other way round.
  *
- * The library writes to the session's outbox, which hands bytes to the socket as far as it takes them and keeps the rest.
- * So no call ever leaves a record half written, which is what the library could not bear: its reader may have a record
- * of its own to send (the answer to a key update) before the writer comes back to finish.
+ * The library writes to the session's outbox, which hands bytes to the socket as far as it takes them and keeps the
+ * rest. So no call ever leaves a record half written, which is what the library could not bear: its reader may have
+ * a record of its own to send (the answer to a key update) before the writer comes back to finish.
  */
 #ifndef CLIENT_TLS_SESSION_H
 #define CLIENT_TLS_SESSION_H
@@ -26,12 +26,12 @@ bool tls_session_connect(SSL *session, tls_clock::time_point end);
 /* Waits for bytes and reads up to `len`: their number, 0 at the session's end, -1 and errno on failure. One thread. */
 int tls_session_read(SSL *session, void *bytes, int len);
 
-/* Writes all `len` bytes, more than 0, and waits until the socket has taken them: `len`; 0 or less, and errno, on failure.
- * What several threads write stays in one piece each. */
+/* Writes all `len` bytes, more than 0, and waits until the socket has taken them: `len`; 0 or less, and errno, on
+ * failure. What several threads write stays in one piece each. */
 int tls_session_write(SSL *session, const void *bytes, int len);
 
-/* From now on what is written may wait until there is enough of it for the network, or no longer: then all of it is sent
- * before this returns. For a writer that has more to write at once. */
+/* From now on what is written may wait until there is enough of it for the network, or no longer: then all of it is
+ * sent before this returns. For a writer that has more to write at once. */
 void tls_session_hold(SSL *session, bool on);
 
 /* Says good-bye, as far as the socket takes it at once, and frees the session. Nobody else may be using it any more. */

@@ -14,7 +14,8 @@ void log_run_syslog_script(const char *path, const char *level, const char *size
 /* Restarts it in the background as the NV items `syslog_path`, `syslog_level` and `syslog_size` say. */
 void log_restart_local_syslog();
 
-/* Breaks such a restart off if it is still under way: its script would kill the log program that is about to be started. */
+/* Breaks such a restart off if it is still under way: its script would kill the log program that is about to be
+ * started. */
 void log_break_off_local_syslog();
 
 /* Size of the partition that the NV item `syslog_path` lies on, in KB: the number that df shows for it in MB, times

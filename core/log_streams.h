@@ -1,12 +1,13 @@
 /*
  * The two live streams of client mode. Each has, at most,
- *   - a data link to the server, owned by the thread that reads it: it alone closes session and socket, at its own end;
+ *   - a data link to the server, owned by the thread that reads it: it alone closes session and socket, at its own
+ *     end;
  *   - over TLS, an intake: a local socket at which the stream's log program is waited for, or connected;
  *   - a producer: the log program, which writes to the data link itself or, over TLS, to the intake.
  *
- * Others may take the link away (a stop, or a newer link that takes its place): its fields are reset here and its owner
- * woken up. Whoever sends on it holds it meanwhile (log_link_use), and the owner waits with its close until that is over.
- * All procedures are for any thread.
+ * Others may take the link away (a stop, or a newer link that takes its place): its fields are reset here and its
+ * owner woken up. Whoever sends on it holds it meanwhile (log_link_use), and the owner waits with its close until
+ * that is over. All procedures are for any thread.
  */
 #ifndef CORE_LOG_STREAMS_H
 #define CORE_LOG_STREAMS_H
@@ -32,8 +33,9 @@ extern int syslog_local_fd LOG_GUARDED_BY(g_registry_lock);
 extern int qxdm_local_fd LOG_GUARDED_BY(g_registry_lock);
 
 /*
- * One thread at a time starts or stops a stream's producer, and hands a descriptor to it, while it has this. Programs run
- * meanwhile. The link's owner has it when it closes the link, so that no descriptor is closed while it is being handed.
+ * One thread at a time starts or stops a stream's producer, and hands a descriptor to it, while it has this.
+ * Programs run meanwhile. The link's owner has it when it closes the link, so that no descriptor is closed while it
+ * is being handed.
  */
 class log_producer_turn
 {
@@ -53,8 +55,8 @@ private:
  * known. They are wanted until the stream is stopped or started anew. */
 unsigned log_stream_start(log_stream stream, const char *ip, int port);
 
-/* Takes the data link away from its owner, closes our end of the intake's connection, and sends an intake home that still
- * waits. */
+/* Takes the data link away from its owner, closes our end of the intake's connection, and sends an intake home that
+ * still waits. */
 void log_stream_stop(log_stream stream);
 
 /* A producer was started that has to do with no link: no ended link's thread may stop it. */
@@ -79,8 +81,8 @@ bool log_link_begin(log_link &link);
 /* Whether the start is still wanted, for a link that is not connected yet. */
 bool log_link_wanted(const log_link &link);
 
-/* Records the link's session, in place of a link that stood there; then, once the link can be used, its socket. False when
- * the start is not wanted any more: the link is not to be used. */
+/* Records the link's session, in place of a link that stood there; then, once the link can be used, its socket.
+ * False when the start is not wanted any more: the link is not to be used. */
 bool log_link_record_session(const log_link &link);
 bool log_link_record(const log_link &link);
 
@@ -100,8 +102,8 @@ void log_link_end(const log_link &link);
 
 /* ---- The data link, for others ---- */
 
-/* The socket of the stream's data link, which is from now on the link that the producer belongs to; -1 when there is none.
- * For the holder of the producer's turn. */
+/* The socket of the stream's data link, which is from now on the link that the producer belongs to; -1 when there is
+ * none. For the holder of the producer's turn. */
 int log_link_for_producer(log_stream stream);
 
 /* Records our end of a connection to the intake, -1: none, and closes the one before. */
@@ -131,8 +133,8 @@ private:
 void log_intake_starting(log_stream stream);
 void log_intake_await(log_stream stream);
 
-/* The intake of the latest start listens on `fd`, in place of one that still waited there; -1: it could not be brought up.
- * False when it is not wanted any more. */
+/* The intake of the latest start listens on `fd`, in place of one that still waited there; -1: it could not be
+ * brought up. False when it is not wanted any more. */
 bool log_intake_listens(log_stream stream, int fd);
 
 /* The intake no longer waits on `fd`: true; false when it was sent home meanwhile. */

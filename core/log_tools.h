@@ -20,8 +20,8 @@ struct log_thread_task {
     pthread_t thread_id;    /* the started thread */
 };
 
-/* Starts `task->entry` with `argument` as a detached thread of 256 KB of stack and stores its id in the task. 0 started, -1
- * failed; only a missing task is logged, the caller logs its own failure. */
+/* Starts `task->entry` with `argument` as a detached thread of 256 KB of stack and stores its id in the task. 0
+ * started, -1 failed; only a missing task is logged, the caller logs its own failure. */
 int log_thread_create(log_thread_task *task, void *argument);
 
 /* ---- NV items ---- */
@@ -52,8 +52,8 @@ int log_exec_cmd(const char *cmdStr);
 /* The same for a line whose program is told a descriptor by its number: it alone inherits `handed_fd`. */
 int log_exec_cmd_with(const char *cmdStr, int handed_fd);
 
-/* The same for a line whose programs are to be a process group of their own: the group's number; 0 when no shell could be
- * run. */
+/* The same for a line whose programs are to be a process group of their own: the group's number; 0 when no shell
+ * could be run. */
 pid_t log_exec_cmd_apart(const char *cmdStr);
 
 /* Runs the shell command line and captures the first line of its output, without its newline and cut at size

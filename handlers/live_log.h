@@ -25,8 +25,9 @@ void live_log_reply(const stream_place &place, const char *result = kSuccess);
 /* Runs the modem log program, which then listens at the address that the line names. */
 void live_log_run_modem(const char *cmd);
 
-/* Stops the modem log and makes ready for a new one. False when that one is not to come, as there is no configuration, or
- * has been started already, as this is a plug-in module in a PC, which it can only go to: then the request is answered. */
+/* Stops the modem log and makes ready for a new one. False when that one is not to come, as there is no
+ * configuration, or has been started already, as this is a plug-in module in a PC, which it can only go to: then the
+ * request is answered. */
 bool live_log_prepare_modem();
 
 /* What a request asks for. */

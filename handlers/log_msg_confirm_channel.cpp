@@ -35,8 +35,8 @@ bool came_in_time()
     return false;
 }
 
-/* The socket that the stream's log program is to write to: over TLS, one that is connected to the stream's intake; else the
- * data link, which may be -1. -1 when there is no connection to the intake (logged). */
+/* The socket that the stream's log program is to write to: over TLS, one that is connected to the stream's intake;
+ * else the data link, which may be -1. -1 when there is no connection to the intake (logged). */
 int producer_socket(log_stream stream, int link_fd, const char *intake)
 {
     if (g_daemon.use_ssl != 1)

@@ -2,8 +2,8 @@
  * Command dispatch: from a control text to the handler of its message id. The table is declared here and
  * defined with the handlers, so that nothing below them knows one.
  *
- * Dispatch keeps no state and runs handlers on the thread that calls it, when its turn has come. Once the thread's command
- * connection has been taken over by another tool, none is run any more. It sends nothing itself.
+ * Dispatch keeps no state and runs handlers on the thread that calls it, when its turn has come. Once the thread's
+ * command connection has been taken over by another tool, none is run any more. It sends nothing itself.
  */
 #ifndef PROTOCOL_LOG_JSON_CODEC_H
 #define PROTOCOL_LOG_JSON_CODEC_H

@@ -37,8 +37,8 @@ unsigned char *log_reassembly_room(log_reassembly &state);
 
 /*
  * Appends a piece, from log_reassembly_room() or from anywhere else, and handles every whole frame, in order, on the
- * calling thread; a rest is kept for the next piece. A frame that cannot be decoded is dropped by itself. 0; -1 only when
- * the buffer cannot be allocated: the piece is lost. Logs at level 6 as "vex_log_manage".
+ * calling thread; a rest is kept for the next piece. A frame that cannot be decoded is dropped by itself. 0; -1 only
+ * when the buffer cannot be allocated: the piece is lost. Logs at level 6 as "vex_log_manage".
  */
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece);
 

@@ -1,6 +1,7 @@
 /*
- * A log program whose log is a file: under the name of syslogd or diag_mdlog it writes /tmp/feed to the descriptor that it
- * is given, as often as /tmp/feed.times says and /tmp/feed.size bytes at a time, and then stays until it is killed.
+ * A log program whose log is a file: under the name of syslogd or diag_mdlog it writes /tmp/feed to the descriptor
+ * that it is given, as often as /tmp/feed.times says and /tmp/feed.size bytes at a time, and then stays until it is
+ * killed.
  *
  *   NAME ... -R tcp_fd=N ...    writes
  *   NAME ... -R unix=PATH ...   writes to a socket that it connects to, as the daemon would for it

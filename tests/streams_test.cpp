@@ -200,7 +200,9 @@ TEST_F(Streams, LeaveNothingBehind)
                 memory = resident();
         }
         EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
+#ifndef __SANITIZE_ADDRESS__ /* which keeps back what is freed */
         EXPECT_GE(memory + 200, resident());
+#endif
         hang_up();
     }
 }
@@ -272,7 +274,7 @@ TEST_F(Streams, BelongToTheLatestStart)
     end(kSyslog);
     tool_link second = start(kSyslog); /* not hit by the restart of the local log, which is still under way */
     confirm(second, kSyslog);
-    const std::size_t for_a_while = std::size_t{500} << 20;
+    const std::size_t for_a_while = std::size_t{250} << 20;
     EXPECT_EQ(std::pair(true, for_a_while), take(second, for_a_while));
     end(kSyslog);
     EXPECT_TRUE(settles(rest));

@@ -42,8 +42,8 @@ std::string tool_command(const char *msgid, const char *group,
 /* Where the device is and what its answer says, as a sentence. */
 std::string tool_said(const tool_device &device, const tool_answer &answer);
 
-/* Sends a command and waits for its answer. Nothing, and `why`, when there was none; then the link is given up, unless it
- * was the user who did not want to wait. */
+/* Sends a command and waits for its answer. Nothing, and `why`, when there was none; then the link is given up,
+ * unless it was the user who did not want to wait. */
 std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
                                          std::span<const unsigned char> data, std::string &why);
 

@@ -60,12 +60,12 @@ bool tool_send(tool_link &link, const std::string &control, std::span<const unsi
  * transfer. */
 std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why);
 
-/* As recv(), without waiting: takes bytes that a frame was read ahead of, or what there is. With EAGAIN, `wanted` says what
- * to wait for. */
+/* As recv(), without waiting: takes bytes that a frame was read ahead of, or what there is. With EAGAIN, `wanted`
+ * says what to wait for. */
 ssize_t tool_read_some(tool_link &link, std::span<unsigned char> bytes, short &wanted);
 
-/* Whether the device still keeps the connection, when its socket is readable: a device says nothing unasked, but its TLS
- * may. */
+/* Whether the device still keeps the connection, when its socket is readable: a device says nothing unasked, but its
+ * TLS may. */
 bool tool_still_there(tool_link &link);
 
 #endif

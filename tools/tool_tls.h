@@ -30,8 +30,8 @@ tls_context tool_tls_server(const std::string &cert, const std::string &key, con
 /* Shakes hands on an accepted, non-blocking socket until `end`. None, and why, when that fails. */
 tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why);
 
-/* A result as recv() and send() have it: bytes, 0 at the end, -1 with errno, EAGAIN when the socket is to be waited for,
- * for `wanted`. */
+/* A result as recv() and send() have it: bytes, 0 at the end, -1 with errno, EAGAIN when the socket is to be waited
+ * for, for `wanted`. */
 ssize_t tool_tls_result(SSL *session, int result, short &wanted);
 
 #endif

@@ -15,8 +15,8 @@ enum class tool_wait {
     interrupted, /* the user wants to end, and from now on every wait says so */
 };
 
-/* From now on SIGINT, SIGTERM and SIGHUP (unless it is ignored) no longer kill the tool but end its waits, so that it can
- * tidy up. */
+/* From now on SIGINT, SIGTERM and SIGHUP (unless it is ignored) no longer kill the tool but end its waits, so that
+ * it can tidy up. */
 void tool_catch_interrupts();
 
 /* Takes back that the user wanted to end, for the last words to the device: only Ctrl-C or SIGTERM, given again, end

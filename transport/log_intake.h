@@ -1,7 +1,7 @@
 /*
- * The intakes of client mode over TLS: local sockets at which the device's log programs write their live output, which goes
- * on, as it comes, to the stream's data link. An intake serves one program and ends with it; it waits for one only as long
- * as its stream wants one (core/log_streams.h).
+ * The intakes of client mode over TLS: local sockets at which the device's log programs write their live output,
+ * which goes on, as it comes, to the stream's data link. An intake serves one program and ends with it; it waits for
+ * one only as long as its stream wants one (core/log_streams.h).
  *
  * Log lines at level 6, failures at level 0, as "vex_log_manage".
  */
