@@ -51,13 +51,6 @@ session_extra *extra_of(SSL *session)
     return static_cast<session_extra *>(g_tls.SSL_get_ex_data(session, 0));
 }
 
-/* As send(), but a full socket takes 0 bytes. */
-ssize_t send_some(int fd, const void *bytes, std::size_t len)
-{
-    const ssize_t n = send(fd, bytes, len, MSG_DONTWAIT | MSG_NOSIGNAL);
-    return n == -1 && (errno == EAGAIN || errno == EINTR) ? 0 : n;
-}
-
 /* Puts bytes behind those that wait; false without memory. */
 bool keep(session_extra &extra, const char *bytes, std::size_t len)
 {
@@ -82,11 +75,11 @@ bool keep(session_extra &extra, const char *bytes, std::size_t len)
 /* Sends what waits, as far as the socket takes it; false, and errno, when the socket has failed. */
 bool pass_on(session_extra &extra)
 {
-    if (extra.waiting() == 0)
+    if (extra.waiting() == 0 || extra.held_back())
         return true;
-    const ssize_t n = send_some(extra.fd, extra.held.get() + extra.from, extra.waiting());
+    const ssize_t n = send(extra.fd, extra.held.get() + extra.from, extra.waiting(), MSG_DONTWAIT | MSG_NOSIGNAL);
     if (n < 0)
-        return false;
+        return errno == EAGAIN || errno == EINTR;
     extra.from += static_cast<std::size_t>(n);
     if (extra.waiting() == 0)
         extra.from = extra.to = 0;
@@ -97,17 +90,12 @@ bool pass_on(session_extra &extra)
 int write_outbox(BIO *outbox, const char *bytes, int len)
 {
     session_extra &extra = *static_cast<session_extra *>(g_tls.BIO_get_data(outbox));
-    ssize_t sent = 0;
-    if (extra.waiting() == 0 && !extra.holding)
-        sent = send_some(extra.fd, bytes, static_cast<std::size_t>(len));
-    if (sent < 0)
-        return -1;
-    return sent == len || keep(extra, bytes + sent, static_cast<std::size_t>(len - sent)) ? len : -1;
+    return keep(extra, bytes, static_cast<std::size_t>(len)) ? len : -1;
 }
 
 long control_outbox(BIO *, int command, long, void *)
 {
-    return command == BIO_CTRL_FLUSH ? 1 : 0; /* bytes are passed on as soon as they can be */
+    return command == BIO_CTRL_FLUSH ? 1 : 0; /* bytes are passed on when the call is over */
 }
 
 /* Waits until the socket is ready, or the time has come. */
@@ -150,13 +138,14 @@ template <typename Call> int run(SSL *session, session_wait kind, tls_clock::tim
         {
             const log_lock hold{extra.lock};
             errno = 0;
-            if (!extra.held_back() && !pass_on(extra))
+            if (!pass_on(extra))
                 return -1;
             if (result <= 0 && extra.waiting() < kOutboxMax) {
                 errno = 0;
                 result = call();
                 wanted = result > 0 ? SSL_ERROR_NONE : what_is_wanted(session, result);
-                if (extra.holding && !extra.held_back() && !pass_on(extra))
+                if (!pass_on(extra) &&
+                    (result <= 0 || kind != session_wait::for_bytes)) /* bytes are not lost for that */
                     return -1;
             }
             waiting = extra.held_back() ? 0 : extra.waiting();
@@ -245,6 +234,7 @@ void tls_session_free(SSL *session)
 {
     const std::unique_ptr<session_extra> extra{extra_of(session)};
     g_tls.SSL_shutdown(session);
+    extra->holding = false;
     pass_on(*extra);
     g_tls.SSL_free(session);
     g_tls.ERR_clear_error();

@@ -2,9 +2,10 @@
  * A TLS session that one thread reads while others write. A lock of its own is held across one library call at a
  * time; all waiting is done without it, so that a reader who waits never holds up a writer, nor the other way round.
  *
- * The library writes to the session's outbox, which hands bytes to the socket as far as it takes them and keeps the
- * rest. So no call ever leaves a record half written, which is what the library could not bear: its reader may have
- * a record of its own to send (the answer to a key update) before the writer comes back to finish.
+ * The library writes to the session's outbox, which takes everything. When the call is over, its bytes go to the
+ * socket, all records of a write together, and what the socket does not take waits. So no call ever leaves a record
+ * half written, which is what the library could not bear: its reader may have a record of its own to send (the answer
+ * to a key update) before the writer comes back to finish.
  */
 #ifndef CLIENT_TLS_SESSION_H
 #define CLIENT_TLS_SESSION_H
