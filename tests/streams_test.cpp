@@ -271,6 +271,7 @@ TEST_F(Streams, BelongToTheLatestStart)
     call(false, 100000);
     const resources rest = used();
     ask(kSyslog, "start", "5001"); /* nobody is there, and when somebody comes, it is not tried any more */
+    EXPECT_TRUE(daemon_->logs("Error is ECONNREFUSED"));
     tool_link first = start(kSyslog);
     confirm(first, kSyslog);
     EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5001"));
