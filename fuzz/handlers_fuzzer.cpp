@@ -13,8 +13,10 @@
 #include "protocol/log_pkg_codec.h"
 #include "tests/memory_platform.h"
 
+#include <cerrno>
 #include <cstring>
 #include <memory>
+#include <pthread.h>
 #include <sys/socket.h>
 
 namespace
@@ -87,9 +89,13 @@ unsigned __wrap_sleep(unsigned)
     return 0;
 }
 void __wrap_sync() {}
+int __wrap_pthread_create(pthread_t *, const pthread_attr_t *, void *(*)(void *), void *)
+{
+    return EAGAIN;
+}
 }
 
-/* A start of a live log gets no threads. */
+/* A start of a live log gets no threads: one of these two takes the place of what would make them. */
 int refuse_thread(log_thread_task *task, void *argument) __asm__("__wrap__Z17log_thread_createP15log_thread_taskPv");
 int refuse_thread(log_thread_task *, void *)
 {
