@@ -88,14 +88,13 @@ public:
         log_send_packet(link.fd(), link.ssl(), piece, len);
     }
 
-    /* Has what is held back sent; false when nothing was. */
-    bool let_go()
+    /* Has what is held back sent. */
+    void let_go()
     {
         const log_link_use link{stream_};
         SSL *const held = std::exchange(holding_, nullptr);
         if (held != nullptr && held == link.ssl()) /* else it went with its link */
             g_daemon.ssl_hold(held, false);
-        return held != nullptr;
     }
 
 private:
