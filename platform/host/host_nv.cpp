@@ -3,7 +3,8 @@
  *
  * A write waits in memory until cfg_save() commits it: under a lock file, so that two processes lose nothing,
  * the whole text goes into a new file, which is synced, renamed over the old one and synced in its folder. At
- * any instant, and whatever loses power, the name holds the old text or the new one, whole.
+ * any instant, and whatever loses power, the name holds the old text or the new one, whole. A call that runs out of
+ * memory has failed like any other: its callers are C, and an exception would end the process.
  */
 #include "platform/host/nv_text.h"
 #include "platform/unique_fd.h"
@@ -16,6 +17,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <mutex>
+#include <new>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <vector>
@@ -132,7 +134,7 @@ std::optional<std::string> get(std::string_view name)
 } // namespace
 
 int vex_nvconfig_read(const char *name, char *value, int max_len)
-{
+try {
     if (name == nullptr || value == nullptr || max_len < 1 || !nv_name_ok(name))
         return 0;
     const std::optional<std::string> item = get(name);
@@ -143,10 +145,12 @@ int vex_nvconfig_read(const char *name, char *value, int max_len)
     if (len < room)
         value[len] = '\0';
     return 1;
+} catch (const std::bad_alloc &) {
+    return 0;
 }
 
 int vex_nvconfig_write(const char *name, const char *value, int len)
-{
+try {
     if (name == nullptr || value == nullptr || len < 0 || !nv_name_ok(name))
         return 0;
     const std::string text{value, strnlen(value, static_cast<std::size_t>(len))};
@@ -158,10 +162,12 @@ int vex_nvconfig_write(const char *name, const char *value, int len)
     else
         items.push_back({name, text});
     return 1;
+} catch (const std::bad_alloc &) {
+    return 0;
 }
 
 int cfg_save()
-{
+try {
     const std::lock_guard hold{g_mutex};
     auto &items = uncommitted();
     if (items.empty())
@@ -170,4 +176,6 @@ int cfg_save()
         return -1;
     items.clear();
     return 0;
+} catch (const std::bad_alloc &) {
+    return -1;
 }
