@@ -5,7 +5,7 @@
 #include "handlers/log_handler.h"
 
 #include <cstdio>
-#include <cstdlib>
+#include <utility>
 
 namespace
 {
@@ -13,32 +13,47 @@ namespace
 constexpr std::size_t kValueSize = 256;
 constexpr std::size_t kReplySize = 2048;
 
-void add_text(cJSON *object, const char *name, const char *value)
+/* Adds an item, which is null without memory, to an object; false, and the item is gone, when it cannot be added. */
+bool add(cJSON *object, const char *name, json_tree item)
 {
-    cJSON_AddItemToObject(object, name, cJSON_CreateString(value));
+    if (!cJSON_AddItemToObject(object, name, item.get()))
+        return false;
+    [[maybe_unused]] const cJSON *const owned_by_object = item.release();
+    return true;
 }
 
-void add_nv_item(cJSON *object, const char *name, const char *item)
+bool add_text(cJSON *object, const char *name, const char *value)
+{
+    return add(object, name, json_tree{cJSON_CreateString(value)});
+}
+
+bool add_nv_item(cJSON *object, const char *name, const char *item)
 {
     char value[kValueSize] = {};
     vex_get_nv_item(item, value, sizeof value);
-    add_text(object, name, value);
+    return add_text(object, name, value);
 }
 
-void fill_version_info(cJSON *info)
+bool add_kernel(cJSON *info)
 {
-    add_nv_item(info, "projectName", "model_name");
-    add_nv_item(info, "VersionNum", "integrate_version");
-    add_nv_item(info, "imei", "imei");
-
     char value[kValueSize] = {};
     vex_popen("cat /proc/version | cut -d '#' -f 2", value, sizeof value);
-    add_text(info, "CompileTime", value);
+    return add_text(info, "CompileTime", value);
+}
 
+bool add_size_max(cJSON *info)
+{
     const int size_max = log_syslog_size_max();
     LOG_NOTE("%s:syslogsizeMax = [%d]\n", "log_msg_get_version_info", size_max);
+    char value[kValueSize];
     std::snprintf(value, sizeof value, "%d", size_max);
-    add_text(info, "syslogsizeMax", value);
+    return add_text(info, "syslogsizeMax", value);
+}
+
+bool fill_version_info(cJSON *info)
+{
+    return add_nv_item(info, "projectName", "model_name") && add_nv_item(info, "VersionNum", "integrate_version") &&
+           add_nv_item(info, "imei", "imei") && add_kernel(info) && add_size_max(info);
 }
 
 /* Sends the tree unformatted, cut at the size of a version reply. Without memory to print it, nothing is
@@ -66,15 +81,16 @@ int log_msg_get_version_info(const char *control, const unsigned char *data, std
         LOG_NOTE("cjson create root fail\n");
         return -1;
     }
-    add_text(root.get(), "msgid", "3");
-    cJSON *info = cJSON_CreateObject();
-    if (info == nullptr) {
+    json_tree info{cJSON_CreateObject()};
+    if (!info) {
         LOG_NOTE("cjson create pVersionInfo fail\n");
         return -1;
     }
-    cJSON_AddItemToObject(root.get(), "VersionInfo", info);
-    fill_version_info(info);
-    add_text(root.get(), "Result", kSuccess);
-    reply_tree(root.get());
+    cJSON *const members = info.get();
+    if (add_text(root.get(), "msgid", "3") && add(root.get(), "VersionInfo", std::move(info)) &&
+        fill_version_info(members) && add_text(root.get(), "Result", kSuccess))
+        reply_tree(root.get());
+    else
+        LOG_NOTE("%s: no memory for the reply\n", __func__);
     return 0;
 }
