@@ -4,9 +4,11 @@
 #include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <link.h>
+#include <netinet/in.h>
 #include <pthread.h>
 #include <sys/mman.h>
 #include <sys/socket.h>
@@ -16,15 +18,22 @@ namespace
 {
 
 fault_board *g_board;
-ElfW(Addr) g_program_begin;
-ElfW(Addr) g_program_end;
 
-/* Whether this call has to fail. */
-bool strikes(fault_call what)
+struct code_range {
+    ElfW(Addr) begin;
+    ElfW(Addr) end;
+};
+code_range g_program;
+code_range g_cjson; /* where the program's own allocator is called from, too: its last step is a jump to malloc */
+
+/* Whether this call has to fail; whose it is, of those that the order may be meant for only. */
+bool strikes(fault_call what, int whose = 0)
 {
     if (g_board == nullptr)
         return false;
     fault_order &order = g_board->call[what];
+    if (order.only.load() != 0 && order.only.load() != whose)
+        return false;
     const auto take_one = [](std::atomic<int> &left) {
         int count = left.load();
         while (count > 0 && !left.compare_exchange_weak(count, count - 1)) {
@@ -40,7 +49,8 @@ bool strikes(fault_call what)
 bool strikes_memory(const void *caller)
 {
     const auto at = reinterpret_cast<ElfW(Addr)>(caller);
-    return at >= g_program_begin && at < g_program_end && strikes(kFaultMemory);
+    const auto within = [at](const code_range &code) { return at >= code.begin && at < code.end; };
+    return (within(g_program) || within(g_cjson)) && strikes(kFaultMemory);
 }
 
 /* The function that would be called but for this library. */
@@ -49,29 +59,44 @@ template <typename Function> Function *next(Function * /*same*/, const char *nam
     return reinterpret_cast<Function *>(dlsym(RTLD_NEXT, name));
 }
 
-template <typename Result> Result fails(Result result, int error)
+template <typename Result> Result fails(fault_call what, Result result, int usual_error)
 {
-    errno = error;
+    const int error = g_board->call[what].error.load();
+    errno = error != 0 ? error : usual_error;
     return result;
 }
 
-int find_program(dl_phdr_info *info, size_t /*size*/, void * /*nothing*/)
+/* What getsockname or getpeername tells of a socket: its address family, its port. */
+struct socket_name {
+    socket_name(int fd, int (*get)(int, sockaddr *, socklen_t *))
+    {
+        socklen_t len = sizeof name;
+        get(fd, reinterpret_cast<sockaddr *>(&name), &len);
+    }
+    int family() const { return name.sin6_family; }
+    int port() const { return ntohs(name.sin6_port); } /* the same place in both families */
+    sockaddr_in6 name{};
+};
+
+int find_code(dl_phdr_info *info, size_t /*size*/, void * /*nothing*/)
 {
+    const bool first = g_program.end == 0; /* the program is */
+    if (!first && std::strstr(info->dlpi_name, "libcjson") == nullptr)
+        return 0;
     for (int i = 0; i < info->dlpi_phnum; ++i) {
         const ElfW(Phdr) &part = info->dlpi_phdr[i];
-        if (part.p_type == PT_LOAD && (part.p_flags & PF_X) != 0) {
-            g_program_begin = info->dlpi_addr + part.p_vaddr;
-            g_program_end = g_program_begin + part.p_memsz;
-        }
+        const ElfW(Addr) begin = info->dlpi_addr + part.p_vaddr;
+        if (part.p_type == PT_LOAD && (part.p_flags & PF_X) != 0)
+            (first ? g_program : g_cjson) = {begin, begin + part.p_memsz};
     }
-    return 1; /* the program is the first */
+    return first ? 0 : 1;
 }
 
 /* What the program starts is spared. */
 __attribute__((constructor)) void load_board()
 {
     unsetenv("LD_PRELOAD");
-    dl_iterate_phdr(find_program, nullptr);
+    dl_iterate_phdr(find_code, nullptr);
     const char *path = std::getenv("VEX_FAULTS");
     const int fd = path == nullptr ? -1 : next(open, "open")(path, O_RDWR | O_CLOEXEC);
     if (fd == -1)
@@ -89,19 +114,21 @@ extern "C" {
 void *malloc(size_t size)
 {
     static auto *const real = next(malloc, "malloc");
-    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(nullptr, ENOMEM) : real(size);
+    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(kFaultMemory, nullptr, ENOMEM) : real(size);
 }
 
 void *calloc(size_t count, size_t size)
 {
     static auto *const real = next(calloc, "calloc");
-    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(nullptr, ENOMEM) : real(count, size);
+    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(kFaultMemory, nullptr, ENOMEM)
+                                                       : real(count, size);
 }
 
 void *aligned_alloc(size_t alignment, size_t size)
 {
     static auto *const real = next(aligned_alloc, "aligned_alloc");
-    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(nullptr, ENOMEM) : real(alignment, size);
+    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(kFaultMemory, nullptr, ENOMEM)
+                                                       : real(alignment, size);
 }
 
 int pthread_create(pthread_t *thread, const pthread_attr_t *attributes, void *(*entry)(void *), void *argument)
@@ -113,25 +140,27 @@ int pthread_create(pthread_t *thread, const pthread_attr_t *attributes, void *(*
 int socket(int domain, int type, int protocol)
 {
     static auto *const real = next(socket, "socket");
-    return strikes(kFaultSocket) ? fails(-1, EMFILE) : real(domain, type, protocol);
+    return strikes(kFaultSocket, domain) ? fails(kFaultSocket, -1, EMFILE) : real(domain, type, protocol);
 }
 
 int bind(int fd, const sockaddr *address, socklen_t len)
 {
     static auto *const real = next(bind, "bind");
-    return strikes(kFaultBind) ? fails(-1, EADDRINUSE) : real(fd, address, len);
+    return strikes(kFaultBind, address->sa_family) ? fails(kFaultBind, -1, EADDRINUSE) : real(fd, address, len);
 }
 
 int listen(int fd, int backlog)
 {
     static auto *const real = next(listen, "listen");
-    return strikes(kFaultListen) ? fails(-1, EADDRINUSE) : real(fd, backlog);
+    return strikes(kFaultListen, socket_name(fd, getsockname).family()) ? fails(kFaultListen, -1, EADDRINUSE)
+                                                                        : real(fd, backlog);
 }
 
 int accept4(int fd, sockaddr *address, socklen_t *len, int flags)
 {
     static auto *const real = next(accept4, "accept4");
-    return strikes(kFaultAccept) ? fails(-1, EMFILE) : real(fd, address, len, flags);
+    return strikes(kFaultAccept, socket_name(fd, getsockname).family()) ? fails(kFaultAccept, -1, EMFILE)
+                                                                        : real(fd, address, len, flags);
 }
 
 int open(const char *path, int flags, ...)
@@ -141,36 +170,50 @@ int open(const char *path, int flags, ...)
     va_start(rest, flags);
     const auto mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
     va_end(rest);
-    return strikes(kFaultOpen) ? fails(-1, EMFILE) : real(path, flags, mode);
+    return strikes(kFaultOpen) ? fails(kFaultOpen, -1, EMFILE) : real(path, flags, mode);
 }
 
 FILE *fopen(const char *path, const char *mode)
 {
     static auto *const real = next(fopen, "fopen");
-    return strikes(kFaultOpen) ? fails<FILE *>(nullptr, EMFILE) : real(path, mode);
+    return strikes(kFaultOpen) ? fails<FILE *>(kFaultOpen, nullptr, EMFILE) : real(path, mode);
 }
 
 int fsync(int fd)
 {
     static auto *const real = next(fsync, "fsync");
-    return strikes(kFaultFsync) ? fails(-1, EIO) : real(fd);
+    return strikes(kFaultFsync) ? fails(kFaultFsync, -1, EIO) : real(fd);
 }
 
 int system(const char *command)
 {
     static auto *const real = next(system, "system");
-    return strikes(kFaultSystem) ? fails(-1, ENOMEM) : real(command);
+    return strikes(kFaultSystem) ? fails(kFaultSystem, -1, ENOMEM) : real(command);
 }
 
 FILE *popen(const char *command, const char *type)
 {
     static auto *const real = next(popen, "popen");
-    return strikes(kFaultPopen) ? fails<FILE *>(nullptr, ENOMEM) : real(command, type);
+    return strikes(kFaultPopen) ? fails<FILE *>(kFaultPopen, nullptr, ENOMEM) : real(command, type);
 }
 
 pid_t fork()
 {
     static auto *const real = next(fork, "fork");
-    return strikes(kFaultFork) ? fails(-1, EAGAIN) : real();
+    return strikes(kFaultFork) ? fails(kFaultFork, -1, EAGAIN) : real();
+}
+
+ssize_t send(int fd, const void *bytes, size_t len, int flags)
+{
+    static auto *const real = next(send, "send");
+    return strikes(kFaultSend, socket_name(fd, getpeername).port()) ? fails(kFaultSend, ssize_t{-1}, ECONNRESET)
+                                                                    : real(fd, bytes, len, flags);
+}
+
+ssize_t recv(int fd, void *bytes, size_t len, int flags)
+{
+    static auto *const real = next(recv, "recv");
+    return strikes(kFaultRecv, socket_name(fd, getpeername).port()) ? fails(kFaultRecv, ssize_t{-1}, ECONNRESET)
+                                                                    : real(fd, bytes, len, flags);
 }
 }

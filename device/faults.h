@@ -20,10 +20,15 @@ enum fault_call {
     kFaultSystem,
     kFaultPopen,
     kFaultFork,
+    kFaultSend,
+    kFaultRecv,
     kFaultCalls
 };
 
 struct fault_order {
+    std::atomic<int> only;   /* sockets of this address family or, to send and receive, with this port at the peer's end
+                                are meant; 0: all are */
+    std::atomic<int> error;  /* errno of those that fail; 0: what is usual */
     std::atomic<int> pass;   /* so many of the next calls are let through, */
     std::atomic<int> fail;   /* then so many fail; set last */
     std::atomic<int> failed; /* have failed so far */

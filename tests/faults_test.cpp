@@ -1,0 +1,210 @@
+/* The daemon on a device in trouble: system calls fail, and it says so and goes on. */
+#include "tests/daemon.h"
+#include "tests/frame.h"
+
+#include <cerrno>
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <netinet/in.h>
+#include <sys/socket.h>
+
+namespace
+{
+
+using std::chrono::steady_clock;
+
+class Faults : public Daemon
+{
+protected:
+    void SetUp() override { prepare_faults(); }
+    /* A tool's port, by which the daemon's calls on its connection are told from others. */
+    static int port_of(const tool_connection &tool)
+    {
+        sockaddr_in6 name{};
+        socklen_t len = sizeof name;
+        EXPECT_EQ(0, getsockname(tool.fd.get(), reinterpret_cast<sockaddr *>(&name), &len));
+        return ntohs(name.sin6_port);
+    }
+};
+
+TEST_F(Faults, EndTheListenerThatTheyHitAndNoOther)
+{
+    const struct {
+        fault what;
+        const char *words;
+        const char *other; /* an address of the family that goes on */
+    } cases[] = {
+        {{.call = kFaultSocket, .only = AF_INET}, "[error]can not create tcp server socket !", "::1"},
+        {{.call = kFaultSocket, .only = AF_INET6}, "[error]can not create tcp server socket !", "127.0.0.1"},
+        {{.call = kFaultBind, .only = AF_INET}, "[error]can not bind socket! errno=98,Address already in use", "::1"},
+        {{.call = kFaultBind, .only = AF_INET6},
+         "[error]can not bind socket ipv6! errno=98,Address already in use",
+         "127.0.0.1"},
+        {{.call = kFaultListen, .only = AF_INET}, "log_server_handle_tcp_msg listen failed ", "::1"},
+        {{.call = kFaultListen, .only = AF_INET6}, "log_server_handle_tcp_msg_ipv6 listen failed ", "127.0.0.1"},
+        {{.call = kFaultThread}, "vex_log_server_thread  FAIL", "::1"},
+        {{.call = kFaultThread, .pass = 1}, "vex_log_server_thread_ipv6  FAIL", "127.0.0.1"},
+    };
+    for (const auto &c : cases) {
+        let_fail(c.what);
+        const daemon_process daemon;
+        EXPECT_TRUE(daemon.logs(c.words));
+        EXPECT_TRUE(daemon.logs(*c.other == ':' ? "_ipv6 accept before" : "log_server_handle_tcp_msg enter"));
+        EXPECT_EQ(kOnline, tool_connection(c.other).ask(kAskMode)) << c.words;
+        EXPECT_EQ(1, failed(c.what.call));
+    }
+}
+
+TEST_F(Faults, LeaveAConnectionWithoutAReaderToTheNextTool)
+{
+    start();
+    for (const int family : {AF_INET, AF_INET6}) {
+        let_fail({.call = kFaultAccept, .only = family});
+        const char *const address = family == AF_INET ? "127.0.0.1" : "::1";
+        const tool_connection first(address); /* the accept that waits takes it */
+        EXPECT_EQ(kOnline, first.ask(kAskMode));
+        EXPECT_TRUE(daemon_->logs("accept error Too many open files(errno: 24) ", family == AF_INET ? 1 : 2));
+        let_fail({.call = kFaultThread});
+        const tool_connection unread(address);
+        EXPECT_TRUE(daemon_->logs("[failed creat log_recv_tcp_msg ", family == AF_INET ? 1 : 2));
+        EXPECT_EQ("(closed)", first.receive());
+        unread.send(frame(kAskMode));
+        EXPECT_EQ(kOnline, tool_connection(address).ask(kAskMode));
+        EXPECT_EQ("(closed)", unread.receive());
+    }
+    EXPECT_TRUE(settles());
+}
+
+TEST_F(Faults, OfAReadEndTheConnectionUnlessItWasInterrupted)
+{
+    start();
+    {
+        const tool_connection tool;
+        EXPECT_EQ(kOnline, tool.ask(kAskMode));
+        const auto begin = steady_clock::now();
+        let_fail({.call = kFaultRecv, .times = 3, .error = EINTR});
+        EXPECT_EQ(kOnline, tool.ask(kAskMode)); /* by the read that was waiting already */
+        EXPECT_EQ(kOnline, tool.ask(kAskMode));
+        EXPECT_LE(std::chrono::milliseconds(60), steady_clock::now() - begin) << "it pauses after each";
+        EXPECT_EQ(3, failed(kFaultRecv));
+        let_fail({.call = kFaultRecv});
+        tool.send(frame(kAskMode));
+        const std::string reply = tool.receive(); /* there is none if the read had not begun yet */
+        EXPECT_EQ("(closed)", reply == kOnline ? tool.receive() : reply);
+        EXPECT_TRUE(daemon_->logs("log_recv_tcp_msg:recvfrom error,errno msg=Connection reset by peer"));
+        EXPECT_TRUE(daemon_->logs("exit log_recv_tcp_msg: fd="));
+    }
+    tool_connection{};
+    EXPECT_TRUE(daemon_->logs("log_recv_tcp_msg:recvcount=0,client close"));
+    EXPECT_TRUE(settles());
+    EXPECT_EQ(0, daemon_->logged("close old fd[")) << "nobody was left to be replaced";
+}
+
+TEST_F(Faults, OfCommandsAndRepliesChangeNothingElse)
+{
+    let_fail({.call = kFaultSystem});
+    start();
+    EXPECT_EQ(1, daemon_->logged("vex_syslog.sh -L -o /logfs -l 7 -s 512 ] System error1"));
+    const tool_connection tool;
+    const struct {
+        fault_call call;
+        std::string request;
+        const char *reply;
+        const char *words; /* in the log */
+    } cases[] = {
+        {kFaultSystem, R"({"msgid":"7","CleanLocalLog":""})", R"("CleanLocalLog":"","Result":"Success"})",
+         "[rm -rf /logfs/*] System error1"},
+        {kFaultSystem, R"({"msgid":"8","bsp":{"module_name":"usb","level":"err"}})",
+         R"("module_name":"usb","level":"err"},"Result":"Success"})", "usb err] System error1"},
+        {kFaultFork, R"({"msgid":"4","syslogParaSet":{"sysloglevel":"3","syslogsize":"9"}})",
+         R"("sysloglevel":"3","syslogsize":"9"},"Result":"Success"})", "-l 3 -s 9 &] System error1"},
+        {kFaultSystem, R"({"msgid":"5","tcpdump":{"InterfaceName":"lo","Action":"start"}})",
+         R"("Action":""},"Result":"Success"})", "-w /logfs/lo.pcap &] System error1"},
+        {kFaultSystem, R"({"msgid":"6","realtimeLog":{"LogType":"syslog","Action":"start"}})",
+         R"("port":"1514","ip":"10.64.0.2"},"Result":"Success"})", ":1514 &] System error1"},
+        {kFaultPopen, R"({"msgid":"3"})", R"("CompileTime":"","syslogsizeMax":"0"},"Result":"Success"})",
+         "syslogsizeMax = [0]"},
+    };
+    for (const auto &c : cases) {
+        let_fail({.call = c.call, .times = 1000});
+        const std::string reply = tool.ask(c.request);
+        EXPECT_TRUE(reply.ends_with(c.reply)) << reply;
+        EXPECT_EQ(1, daemon_->logged(c.words)) << c.words;
+        let_fail({.call = c.call, .times = 0});
+    }
+    let_fail({.call = kFaultSend, .times = 2, .only = port_of(tool)});
+    tool.send(frame(R"({"msgid":"3"})") + frame(R"({"msgid":"11"})") + frame(kAskMode));
+    EXPECT_EQ(kOnline, tool.receive());
+    EXPECT_EQ(2, daemon_->logged("log_send_pkg_msg: send pkg fail"));
+}
+
+TEST_F(Faults, LoseAnArchiveAndNothingElse)
+{
+    install_program("tar", "echo logs >$2; echo packs >/tmp/packs; read go </tmp/go");
+    run_command("mkfifo /tmp/packs /tmp/go");
+    start();
+    const tool_connection tool;
+    const std::string sent = R"({"msgid":"2","GetLocalLog":{"totalLength":"5"},"Result":"Success"})";
+    const std::string not_opened =
+        R"({"msgid":"2","GetLocalLog":{"totalLength":"0"},"Result":"Fail:Open log file error"})";
+    const struct {
+        fault what;
+        std::string reply;
+    } cases[] = {
+        {{.call = kFaultMemory}, not_opened}, /* the first frame's block */
+        {{.call = kFaultOpen}, not_opened},
+        {{.call = kFaultSend, .times = 2, .only = port_of(tool)}, sent},
+        {{.call = kFaultSend, .times = 3, .only = port_of(tool)}, kOnline}, /* nothing more is said of it */
+        {{.call = kFaultSystem}, sent},                                     /* it cannot be removed */
+    };
+    for (const auto &c : cases) {
+        let_fail({.call = kFaultPopen});  /* the look at the space that is left, */
+        let_fail({.call = kFaultSystem}); /* and the script that tells how the device is */
+        tool.send(frame(R"({"msgid":"2"})") + frame(kAskMode));
+        EXPECT_EQ("packs\n", read_file("/tmp/packs"));
+        EXPECT_EQ(1, failed(kFaultPopen) * failed(kFaultSystem));
+        let_fail(c.what);
+        std::ofstream("/tmp/go") << "go" << std::endl;
+        std::string data;
+        EXPECT_EQ(c.reply, tool.receive(&data)) << c.what.call;
+        EXPECT_EQ(c.reply == sent ? "logs\n" : "", data);
+        EXPECT_EQ(kOnline, c.reply == kOnline ? kOnline : tool.receive());
+        EXPECT_EQ(c.what.times, failed(c.what.call));
+        EXPECT_EQ(c.reply == not_opened || c.what.call == kFaultSystem,
+                  std::filesystem::exists("/tmp/MBBlogfs.tar.gz"));
+    }
+    EXPECT_EQ(1, daemon_->logged("log_msg_get_log_file:send data fail"));
+}
+
+/* Every allocation that a command leads to fails once. */
+TEST_F(Faults, OfMemoryLoseTheCommandThatTheyHit)
+{
+    start();
+    const tool_connection tool;
+    long pieces = 0;
+    std::string large = R"({"msgid":"3","x":[0)"; /* a tree that leaves none of the thread's own memory */
+    for (int i = 0; i < 100; ++i)
+        large += ",0";
+    for (const std::string &request : {std::string(R"({"msgid":"11","mode_lpm_online":"?"})"), large + "]}"}) {
+        int pass = 0;
+        for (bool hit = true; hit; ++pass) {
+            let_fail({.call = kFaultMemory, .pass = pass});
+            tool.send(frame(request));
+            ASSERT_TRUE(daemon_->logs("waiting recv data", ++pieces)) << pass << read_file("/tmp/daemon.out");
+            hit = failed(kFaultMemory) != 0;
+        }
+        let_fail({.call = kFaultMemory, .times = 0});
+        EXPECT_LT(2, pass);
+    }
+    for (const char *words : {"LOG_RECV_PKG_LEN malloc failed.", "sendbuf malloc failed .", "cJSON_Parse error",
+                              "cjson create root fail", "cjson create pVersionInfo fail"})
+        EXPECT_NE(0, daemon_->logged(words)) << words;
+    tool.send(frame(kAskMode));
+    std::string reply;
+    while ((reply = tool.receive()) != kOnline)
+        ASSERT_TRUE(reply.ends_with(R"("Result":"Success"})") || reply == mode_reply("", "Fail:parameter error"))
+            << reply;
+}
+
+} // namespace
