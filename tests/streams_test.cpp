@@ -6,6 +6,8 @@
 #include <atomic>
 #include <fstream>
 #include <random>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <thread>
 
 namespace
@@ -43,7 +45,7 @@ protected:
         listener_.port = "5000";
     }
     /* Has the device call. */
-    void call(bool tls, int feed_times)
+    void call(bool tls, int feed_times, const char *tries = "10")
     {
         std::string why;
         set_nv("log_use_ssl_disable", tls ? "0" : "1");
@@ -51,16 +53,31 @@ protected:
         if (tls)
             listener_.context = tool_tls_server("/tmp/c/server.crt", "/tmp/c/server.key", "/tmp/c/ca.crt", why);
         ASSERT_TRUE(tool_listen(listener_, why)) << why;
-        daemon_.emplace(std::vector<std::string>{"-a", "127.0.0.1", "-p", "5000"});
-        control_.emplace(std::move(accept("9")->link));
+        daemon_.emplace(std::vector<std::string>{"-a", "127.0.0.1", "-p", "5000", "-r", tries});
+        control_.emplace(std::move(accept("9", listener_)->link));
     }
-    std::optional<tool_call> accept(const char *msgid)
+    /* One more place to be called at, without TLS; a call there. */
+    static tool_listener listen_at(const char *port)
+    {
+        tool_listener listener;
+        listener.port = port;
+        std::string why;
+        EXPECT_TRUE(tool_listen(listener, why)) << why;
+        return listener;
+    }
+    static unique_fd accept_bare(const tool_listener &listener)
+    {
+        pollfd entry{listener.fd.get(), POLLIN, 0};
+        EXPECT_EQ(1, poll(&entry, 1, kPatience));
+        return unique_fd{accept4(listener.fd.get(), nullptr, nullptr, SOCK_CLOEXEC)};
+    }
+    static std::optional<tool_call> accept(const char *msgid, tool_listener &listener)
     {
         std::string why;
-        pollfd entry{listener_.fd.get(), POLLIN, 0};
+        pollfd entry{listener.fd.get(), POLLIN, 0};
         EXPECT_EQ(1, poll(&entry, 1, kPatience));
         std::optional<tool_call> call =
-            tool_take_call(listener_, {}, tool_clock::now() + std::chrono::milliseconds(kPatience), why);
+            tool_take_call(listener, {}, tool_clock::now() + std::chrono::milliseconds(kPatience), why);
         EXPECT_TRUE(call && call->msgid == msgid) << why;
         return call;
     }
@@ -77,13 +94,21 @@ protected:
             tool_command("6", "realtimeLog",
                          {{"LogType", which.log_type}, {"Action", action}, {"ip", "127.0.0.1"}, {"port", port}}));
     }
+    void order(const stream &which, const char *port = "5000")
+    {
+        EXPECT_EQ(R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":")" +
+                      std::string(port) + R"(","ip":"127.0.0.1"},"Result":"Success"})",
+                  ask(which, "start", port));
+    }
     /* Starts a stream; its data link, which is not confirmed yet. */
     tool_link start(const stream &which)
     {
-        EXPECT_EQ(
-            R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":"5000","ip":"127.0.0.1"},"Result":"Success"})",
-            ask(which, "start"));
-        std::optional<tool_call> call = accept("10");
+        order(which);
+        return accept_link(which, listener_);
+    }
+    static tool_link accept_link(const stream &which, tool_listener &listener)
+    {
+        std::optional<tool_call> call = accept("10", listener);
         EXPECT_EQ(which.connect_type, tool_announced(*call, "DataLink", "ConnectType"));
         EXPECT_EQ(kImei, tool_announced(*call, "DataLink", "imei"));
         return std::move(call->link);
@@ -344,6 +369,170 @@ TEST_F(Streams, EndAtAnyMoment)
         EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
         hang_up();
     }
+}
+
+/* A stream's own parts fail, and its server is told that it has been started all the same. */
+TEST_F(Streams, MayFailToBegin)
+{
+    prepare_faults();
+    call(true, 1000, "1");
+    const resources rest = used();
+    const struct {
+        fault what;
+        const char *words;
+        bool calls; /* whether there is a data link all the same */
+    } cases[] = {
+        {{.call = kFaultThread}, "vex_log_recv_syslog_thread  FAIL", true},
+        {{.call = kFaultThread, .pass = 1}, "vex_log_client_syslog_thread  FAIL", false},
+        {{.call = kFaultSocket, .only = AF_UNIX}, "can not create socket. errno: 24", true},
+        {{.call = kFaultBind, .only = AF_UNIX}, "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
+        {{.call = kFaultListen, .only = AF_UNIX}, "can not listen socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
+        {{.call = kFaultAccept, .only = AF_UNIX}, "can not accept client, errno: 24", true},
+        {{.call = kFaultSocket, .only = AF_INET}, "Error calling socket: Too many open files, errno: 24", false},
+    };
+    long refused = 0;
+    for (const auto &c : cases) {
+        daemon_->commands();
+        let_fail(c.what);
+        order(kSyslog);
+        EXPECT_TRUE(daemon_->logs(c.words));
+        if (c.calls) {
+            tool_link link = accept_link(kSyslog, listener_);
+            EXPECT_TRUE(settles({rest.first + 1, rest.second + 1})) << c.words;
+            confirm(link, kSyslog); /* its program would have nowhere to write to */
+            EXPECT_TRUE(daemon_->logs("can not connect to:/tmp/MSG_ID_SYSLOG, errno: ", ++refused));
+            EXPECT_EQ("", daemon_->commands());
+        }
+        end(kSyslog);
+        EXPECT_TRUE(settles(rest)) << c.words;
+    }
+    order(kSyslog, "5003");
+    EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5003"));
+    const tool_listener no_tls = listen_at("5004");
+    order(kSyslog, "5004");
+    accept_bare(no_tls).reset();
+    EXPECT_TRUE(daemon_->logs("vex_open_ssl: SSL connect error "));
+    EXPECT_TRUE(settles(rest));
+    hang_up();
+}
+
+TEST_F(Streams, AreNotBegunWithoutWhatTheirProgramsNeed)
+{
+    prepare_faults();
+    call(true, 1000);
+    daemon_->commands();
+    confirm(*control_, kSyslog); /* there is no link */
+    EXPECT_EQ(kOnline, ask(kAskMode));
+    EXPECT_EQ("", daemon_->commands());
+    tool_link links[] = {start(kSyslog), start(kModem)};
+    daemon_->commands();
+    let_fail({.call = kFaultSocket, .only = AF_UNIX});
+    confirm(links[0], kSyslog);
+    EXPECT_TRUE(daemon_->logs("create socket error, errno: 24"));
+    EXPECT_EQ("", daemon_->commands());
+    const std::string prepared = "killall -9 diag_mdlog\necho 3 > /proc/sys/vm/drop_caches\nrm /tmp/diag_logs\n";
+    let_fail({.call = kFaultSocket, .only = AF_UNIX});
+    confirm(links[1], kModem);
+    EXPECT_TRUE(daemon_->logs("create socket error, errno: 24", 2));
+    EXPECT_EQ(prepared, daemon_->commands());
+    run_command("rm /logfs/logconf/Diag.cfg");
+    confirm(links[1], kModem);
+    EXPECT_TRUE(daemon_->logs("qxdm Diag.cfg is not exisit"));
+    EXPECT_EQ("killall -9 diag_mdlog\n", daemon_->commands());
+    run_command("touch /logfs/logconf/Diag.cfg");
+    let_fail({.call = kFaultFork});
+    confirm(links[1], kModem);
+    EXPECT_TRUE(daemon_->logs("&] System error1")) << "the program could not be started";
+    confirm(links[0], kSyslog); /* no syslogd is there to be killed */
+    EXPECT_EQ(std::pair(true, feed_.size()), take(links[0], feed_.size()));
+    EXPECT_NE(0, daemon_->logged("[killall -9 syslogd] System error3"));
+    hang_up();
+}
+
+/* This test is the log program, too. */
+TEST_F(Streams, TakeWhatTheirProgramsWriteToTheEnd)
+{
+    prepare_faults();
+    call(true, 0);
+    const resources rest = used();
+    const auto send_all = [this](const unique_fd &program, std::size_t len) {
+        EXPECT_EQ(static_cast<ssize_t>(len), send(program.get(), feed_.data(), len, MSG_NOSIGNAL));
+    };
+    const auto connect_program = [] {
+        unique_fd program{socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+        const sockaddr_un intake{AF_UNIX, "/tmp/MSG_ID_SYSLOG"};
+        EXPECT_EQ(0, connect(program.get(), reinterpret_cast<const sockaddr *>(&intake), sizeof intake));
+        return program;
+    };
+    {
+        tool_link link = start(kSyslog);
+        unique_fd program = connect_program();
+        let_fail({.call = kFaultRecv, .times = 3, .error = EINTR});
+        send_all(program, 5000);
+        EXPECT_EQ(std::pair(true, std::size_t{5000}), take(link, 5000));
+        EXPECT_EQ(3, failed(kFaultRecv));
+        let_fail({.call = kFaultSend, .only = 5000});
+        send_all(program, 10);
+        while (failed(kFaultSend) == 0)
+            std::this_thread::yield();
+        /* The link ends before its program does. */
+        {
+            const tool_link gone = std::move(link);
+        }
+        EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg"));
+        send_all(program, feed_.size());
+        program.reset();
+        EXPECT_TRUE(daemon_->logs("log_server_handle_realtimelog:recvcount=0,client close log_type=[0]"));
+        EXPECT_TRUE(settles(rest));
+    }
+    tool_link link = start(kSyslog);
+    const unique_fd program = connect_program();
+    let_fail({.call = kFaultRecv});
+    send_all(program, 10);
+    EXPECT_TRUE(daemon_->logs("log_server_handle_realtimelog:recvfrom error,errno msg=Connection reset by peer"));
+    hang_up();
+    EXPECT_NE(std::string::npos, read_file("/tmp/daemon.out").find("log_send_packet data fail  errno= 104 (Conn"));
+}
+
+TEST_F(Streams, EndTheirLinksWithTheirErrors)
+{
+    prepare_faults();
+    call(false, 1000);
+    const resources rest = used();
+    tool_listener other = listen_at("5002");
+    let_fail({.call = kFaultSend, .times = 3, .only = 5002});
+    order(kSyslog, "5002");
+    EXPECT_TRUE(daemon_->logs(") syslog connect "));
+    EXPECT_EQ(2, daemon_->logged("log_client_syslog_thread_proc :try send pkg msg "));
+    EXPECT_TRUE(settles(rest));
+    accept_bare(other).reset(); /* nothing was heard of it */
+    let_fail({.call = kFaultSend, .times = 2, .only = 5002});
+    order(kModem, "5002");
+    {
+        tool_link link = accept_link(kModem, other);
+        EXPECT_EQ(2, daemon_->logged("log_client_qxdm_thread_proc :try send pkg msg "));
+        let_fail({.call = kFaultRecv, .times = 2, .only = 5002, .error = EINTR});
+        for (int i = 0; i < 2; ++i) {
+            confirm(link, kModem);
+            EXPECT_TRUE(daemon_->logs("cmdStr[diag_mdlog -f", i + 1));
+        }
+        EXPECT_EQ(2, failed(kFaultRecv));
+        daemon_->commands();
+        let_fail({.call = kFaultRecv, .only = 5002});
+        confirm(link, kSyslog);
+        EXPECT_TRUE(daemon_->logs("log_recv_server_msg:recvfrom error,errno msg=Connection reset by peer"));
+        EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg: fd=["));
+        EXPECT_TRUE(daemon_->commands().ends_with("diag_mdlog -k \n"));
+    }
+    {
+        const tool_link link = start(kSyslog);
+        let_fail({.call = kFaultFork});
+    }
+    EXPECT_TRUE(daemon_->logs("log_recv_server_msg:recvcount=0,client close fd["));
+    EXPECT_TRUE(daemon_->logs("vex_syslog.sh -L -o /logfs -l 7 -s 512 &] System error1"));
+    EXPECT_TRUE(settles(rest));
+    EXPECT_EQ(kOnline, ask(kAskMode));
+    hang_up();
 }
 
 } // namespace
