@@ -2,6 +2,8 @@
 #include "tests/frame.h"
 
 #include <fstream>
+#include <sys/syscall.h>
+#include <thread>
 
 namespace
 {
@@ -110,19 +112,25 @@ TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
     const struct {
         std::string spoil;
         std::string words;
+        int status;
+        bool why; /* whether the library's own words are printed */
     } cases[] = {
-        {"mv logca_cert.crt x", "Failed to load CA file /usr/vex/vex_conf/logcert/logca_cert.crt"},
+        {"mv logca_cert.crt x", "Failed to load CA file /usr/vex/vex_conf/logcert/logca_cert.crt", 1, false},
         {"mv x logca_cert.crt; echo >logclient_cert.crt",
-         "Failed to load user certificate file /usr/vex/vex_conf/logcert/logclient_cert.crt"},
-        {"cp /tmp/c/device.crt logclient_cert.crt; echo >logkey.pem", "[ERROR]use private key fail!"},
-        {"cp /tmp/c/server.key logkey.pem", "[ERROR]use private key fail!"},
+         "Failed to load user certificate file /usr/vex/vex_conf/logcert/logclient_cert.crt", 1, true},
+        {"cp /tmp/c/device.crt logclient_cert.crt; echo >logkey.pem", "[ERROR]use private key fail!", 1, true},
+        {"cp /tmp/c/server.key logkey.pem", "[ERROR]use private key fail!", 1, true},
+        {"echo openssl_conf=o '[o]' providers=p '[p]' null=n '[n]' activate=1 | tr ' ' '\\n' >/tmp/none.cnf",
+         "**SOCKET: Create SSL_CTX error...", 255, true},
     };
+    setenv("OPENSSL_CONF", "/tmp/none.cnf", 1); /* in the end, TLS without its algorithms */
     for (const auto &c : cases) {
         run_command(std::string("cd ") + kCertDir + "; " + c.spoil);
         daemon_process daemon({"-a", "127.0.0.1"});
-        EXPECT_EQ(1, daemon.wait_exit()) << c.spoil;
+        EXPECT_EQ(c.status, daemon.wait_exit()) << c.spoil;
         EXPECT_EQ(1, daemon.logged(" 0 vex_log_manage")) << c.spoil;
         EXPECT_EQ(1, daemon.logged(c.words)) << daemon.log();
+        EXPECT_EQ(c.why, read_file("/tmp/daemon.out").find(":error:") != std::string::npos) << c.spoil;
         EXPECT_EQ(0, daemon.logged("log_client_ctl_thread_proc"));
     }
 }
@@ -178,17 +186,52 @@ TEST_F(Client, EndsWithItsServerWheneverThatIs)
 
 TEST_F(Client, EndsWithoutAServerToCall)
 {
-    for (const auto &[retries, tries] : {std::pair{"0", 0}, {"-1", 0}, {"1", 1}}) {
-        daemon_process daemon({"-a", "127.0.0.1", "-p", "9", "-r", retries});
-        EXPECT_EQ(0, daemon.wait_exit());
-        EXPECT_EQ(tries, daemon.logged("Error is ECONNREFUSED - No one is listening on the remote ip address"));
-        EXPECT_EQ(1, daemon.logged("fail connect to address: 127.0.0.1, port number: 9"));
+    const std::string failed_line = "fail connect to address: ";
+    const std::string none_there = "Error is ECONNREFUSED - No one is listening on the remote ip address";
+    const struct {
+        const char *address;
+        const char *tries;
+        std::vector<std::string> words;
+        long failures; /* lines that say so in the end */
+    } cases[] = {
+        {"127.0.0.1", "0", {"Trying to connect to address: 127.0.0.1, port: 0", failed_line}, 1},
+        {"127.0.0.1", "-1", {failed_line + "127.0.0.1, port number: 0"}, 1},
+        {"127.0.0.1", "1", {"Error calling connect: Connection refused, errno: 111", none_there}, 1},
+        {"8.8.8.8", "1", {"Network is unreachable,errno: 101 Re-trying ...", failed_line + "8.8.8.8, port"}, 1},
+        {"fe80::1", "9", {"Error calling connect: Invalid argument, errno: 22", "Invalid argument.  Exiting... "}, 0},
+        {"", "9", {"getaddrinfo error: -2, ", "getaddrinfo did not return list of addrinfo structures."}, 0},
+    };
+    run_command("sed -i /^log_server_port=/d /etc/vex/nvconfig");
+    for (const auto &c : cases) {
+        const daemon_process daemon({"-a", c.address, "-r", c.tries});
+        EXPECT_TRUE(daemon.logs("vex_log_manage exit "));
+        for (const std::string &words : c.words)
+            EXPECT_EQ(1, daemon.logged(words)) << words << daemon.log();
+        EXPECT_EQ(c.failures, daemon.logged(failed_line)) << c.address;
     }
-    set_nv("log_server_addr", "");
     set_nv("log_manage_mode", "7");
     daemon_process daemon({"-p", "5000"});
     EXPECT_EQ(0, daemon.wait_exit());
     EXPECT_EQ(1, daemon.logged("vex_log_manage exit "));
+}
+
+TEST_F(Client, GoesOnWithoutItsThreadOrItsAnnouncement)
+{
+    prepare_faults();
+    set_nv("log_use_ssl_disable", "1");
+    {
+        let_fail({.call = kFaultThread});
+        const daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+        EXPECT_TRUE(daemon.logs("vex_log_client_ctl_thread  FAIL"));
+        while (!daemon.waits_in(SYS_clock_nanosleep)) /* and does not end */
+            std::this_thread::yield();
+    }
+    std::ofstream("/tmp/ask") << frame(kAskMode);
+    let_fail({.call = kFaultSend, .only = 5000});
+    start_server("{ cat /tmp/ask; until grep -q online /tmp/said; do sleep 0.01; done; } | busybox nc -l -p 5000");
+    daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+    EXPECT_EQ(0, daemon.wait_exit());
+    EXPECT_EQ(frame(kOnline), server_said());
 }
 
 } // namespace
