@@ -201,6 +201,14 @@ bool daemon_process::waits_in(long syscall) const
     return false;
 }
 
+bool daemon_process::settles(const resources &expected) const
+{
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
+    while (used() != expected && std::chrono::steady_clock::now() < end)
+        std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
+    return used() == expected;
+}
+
 void prepare_faults()
 {
     const unique_fd file{open(kFaultFile, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600)};
@@ -230,20 +238,7 @@ void Daemon::start(bool streams)
 {
     daemon_ = std::make_unique<daemon_process>(std::vector<std::string>{}, streams);
     daemon_->wait_listening();
-    descriptors_ = entries(daemon_->proc("fd"));
-    threads_ = entries(daemon_->proc("task"));
-}
-
-bool Daemon::settles(std::size_t more_descriptors, std::size_t more_threads) const
-{
-    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
-    while (entries(daemon_->proc("fd")) != descriptors_ + more_descriptors ||
-           entries(daemon_->proc("task")) != threads_ + more_threads) {
-        if (std::chrono::steady_clock::now() > end)
-            return false;
-        std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
-    }
-    return true;
+    rest_ = daemon_->used();
 }
 
 std::size_t entries(const std::string &dir)

@@ -12,9 +12,13 @@
 #include <memory>
 #include <string>
 #include <sys/types.h>
+#include <utility>
 #include <vector>
 
 constexpr int kPatience = 30000; /* milliseconds */
+
+/* How much there is in a folder. */
+std::size_t entries(const std::string &dir);
 
 /* A log tool's connection to 127.0.0.1 or ::1. */
 struct tool_connection {
@@ -25,6 +29,9 @@ struct tool_connection {
     std::string ask(const std::string &control, const std::string &data = "") const;
     unique_fd fd;
 };
+
+/* Descriptors and threads of a daemon. */
+using resources = std::pair<std::size_t, std::size_t>;
 
 class daemon_process
 {
@@ -46,6 +53,9 @@ public:
     std::string proc(const char *name) const { return "/proc/" + std::to_string(pid) + '/' + name; }
     /* Whether one of its threads waits in that system call. */
     bool waits_in(long syscall) const;
+    resources used() const { return {entries(proc("fd")), entries(proc("task"))}; }
+    /* Whether it comes to use just that. */
+    bool settles(const resources &expected) const;
 
     pid_t pid = -1;
 
@@ -75,12 +85,14 @@ class Daemon : public testing::Test
 {
 protected:
     void start(bool streams = true);
-    /* Whether it comes to have as many descriptors and threads as at its start, and so many more. */
-    bool settles(std::size_t more_descriptors = 0, std::size_t more_threads = 0) const;
+    /* Whether it comes to use what it did then, and so much more. */
+    bool settles(const resources &more = {0, 0}) const
+    {
+        return daemon_->settles({rest_.first + more.first, rest_.second + more.second});
+    }
 
     std::unique_ptr<daemon_process> daemon_;
-    std::size_t descriptors_ = 0;
-    std::size_t threads_ = 0;
+    resources rest_;
 };
 
 /* A command that runs no program, and its reply. */
@@ -88,7 +100,6 @@ extern const std::string kAskMode;
 extern const std::string kOnline;
 std::string mode_reply(const std::string &mode, const std::string &result);
 
-std::size_t entries(const std::string &dir);
 std::string read_file(const std::string &path);
 
 /* Sets an item in the device's NV file, as an operator would; an item's value. */

@@ -172,7 +172,7 @@ TEST_F(Daemon, KeepsReplacedToolsCommandsFromTheNewOne)
         second.send(frame(kAskMode));
         EXPECT_EQ("(closed)", first.receive());
         ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =47", 21));
-        EXPECT_TRUE(settles(3, 2)); /* two connections with their threads, and the pipe from df */
+        EXPECT_TRUE(settles({3, 2})); /* two connections with their threads, and the pipe from df */
         EXPECT_EQ(0, daemon_->logged("log_msg_mode_lpm_online"));
         std::ofstream("/tmp/go") << "go" << std::endl;
         EXPECT_EQ(kOnline, second.receive());

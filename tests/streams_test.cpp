@@ -144,17 +144,6 @@ protected:
     }
     /* Waits for the device to end a link. */
     bool ended(tool_link &link) const { return take(link, SIZE_MAX).second < SIZE_MAX; }
-    /* The daemon's descriptors and threads. */
-    using resources = std::pair<std::size_t, std::size_t>;
-    resources used() const { return {entries(daemon_->proc("fd")), entries(daemon_->proc("task"))}; }
-    /* Whether it comes to have as many as at another time. */
-    bool settles(const resources &before) const
-    {
-        const auto end = tool_clock::now() + std::chrono::milliseconds(kPatience);
-        while (used() != before && tool_clock::now() < end)
-            std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
-        return used() == before;
-    }
     /* Its memory, in kB. */
     long resident() const { return std::stol(run_command("sed -n 's/VmRSS:[ \t]*//p' " + daemon_->proc("status"))); }
     /* The device's daemon ends with its server. */
@@ -215,7 +204,7 @@ TEST_F(Streams, LeaveNothingBehind)
         call(tls, 2);
         const char *const given = getenv("VEX_STREAM_CYCLES"); /* for more of them, by hand */
         const int cycles = given != nullptr ? std::atoi(given) : 30;
-        const resources rest = used();
+        const resources rest = daemon_->used();
         long memory = 0;
         for (int i = 0; i < cycles; ++i) {
             tool_link syslog = start(kSyslog);
@@ -230,7 +219,7 @@ TEST_F(Streams, LeaveNothingBehind)
             if (i == 9)
                 memory = resident();
         }
-        EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
+        EXPECT_TRUE(daemon_->settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
         EXPECT_TRUE(!kMemoryIsOurs || resident() <= memory + 200);
         hang_up();
     }
@@ -240,7 +229,7 @@ TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
 {
     for (const bool tls : {false, true}) {
         call(tls, 1000);
-        const resources rest = used();
+        const resources rest = daemon_->used();
         for (const stream &which : {kSyslog, kModem}) {
             end(which); /* without a start */
             {
@@ -248,12 +237,12 @@ TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
                 end(which);
                 confirm(link, which);
                 EXPECT_TRUE(ended(link));
-                EXPECT_TRUE(settles(rest));
+                EXPECT_TRUE(daemon_->settles(rest));
             }
             {
                 const tool_link never_confirmed = start(which);
             }
-            EXPECT_TRUE(settles(rest)) << "the server has hung up";
+            EXPECT_TRUE(daemon_->settles(rest)) << "the server has hung up";
             {
                 tool_link first = start(which); /* started twice: the second takes the first one's place */
                 confirm(first, which);
@@ -262,7 +251,7 @@ TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
                 EXPECT_TRUE(ended(first));
                 end(which);
                 EXPECT_TRUE(ended(second));
-                EXPECT_TRUE(settles(rest));
+                EXPECT_TRUE(daemon_->settles(rest));
             }
             {
                 tool_link link = start(which);
@@ -272,14 +261,14 @@ TEST_F(Streams, MayBeStartedAndEndedInAnyOrder)
                 EXPECT_EQ(kOnline, ask(kAskMode));
                 end(which);
                 EXPECT_TRUE(ended(link));
-                EXPECT_TRUE(settles(rest));
+                EXPECT_TRUE(daemon_->settles(rest));
             }
             {
                 tool_link deaf = start(which); /* its server stops reading: a stop works all the same */
                 confirm(deaf, which);
                 EXPECT_TRUE(take(deaf, 100000).first);
                 end(which);
-                EXPECT_TRUE(settles(rest));
+                EXPECT_TRUE(daemon_->settles(rest));
             }
             tool_link link = start(which);
             confirm(link, which);
@@ -294,7 +283,7 @@ TEST_F(Streams, BelongToTheLatestStart)
 {
     install_program("killall", "[ $1 = -q ] && sleep 0.2\nexec /usr/vex/bin/killall \"$@\"");
     call(false, 100000);
-    const resources rest = used();
+    const resources rest = daemon_->used();
     ask(kSyslog, "start", "5001"); /* nobody is there, and when somebody comes, it is not tried any more */
     EXPECT_TRUE(daemon_->logs("Error is ECONNREFUSED"));
     tool_link first = start(kSyslog);
@@ -307,7 +296,7 @@ TEST_F(Streams, BelongToTheLatestStart)
     const std::size_t for_a_while = std::size_t{250} << 20;
     EXPECT_EQ(std::pair(true, for_a_while), take(second, for_a_while));
     end(kSyslog);
-    EXPECT_TRUE(settles(rest));
+    EXPECT_TRUE(daemon_->settles(rest));
     hang_up();
 }
 
@@ -338,7 +327,7 @@ TEST_F(Streams, EndAtAnyMoment)
 {
     for (const bool tls : {false, true}) {
         call(tls, 1000);
-        const resources rest = used();
+        const resources rest = daemon_->used();
         std::mt19937 random{2206};
         for (int i = 0; i < 25; ++i) {
             std::optional<tool_link> links[2];
@@ -366,7 +355,7 @@ TEST_F(Streams, EndAtAnyMoment)
             end(kSyslog);
             end(kModem);
         }
-        EXPECT_TRUE(settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
+        EXPECT_TRUE(daemon_->settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
         hang_up();
     }
 }
@@ -376,7 +365,7 @@ TEST_F(Streams, MayFailToBegin)
 {
     prepare_faults();
     call(true, 1000, "1");
-    const resources rest = used();
+    const resources rest = daemon_->used();
     const struct {
         fault what;
         const char *words;
@@ -398,13 +387,13 @@ TEST_F(Streams, MayFailToBegin)
         EXPECT_TRUE(daemon_->logs(c.words));
         if (c.calls) {
             tool_link link = accept_link(kSyslog, listener_);
-            EXPECT_TRUE(settles({rest.first + 1, rest.second + 1})) << c.words;
+            EXPECT_TRUE(daemon_->settles({rest.first + 1, rest.second + 1})) << c.words;
             confirm(link, kSyslog); /* its program would have nowhere to write to */
             EXPECT_TRUE(daemon_->logs("can not connect to:/tmp/MSG_ID_SYSLOG, errno: ", ++refused));
             EXPECT_EQ("", daemon_->commands());
         }
         end(kSyslog);
-        EXPECT_TRUE(settles(rest)) << c.words;
+        EXPECT_TRUE(daemon_->settles(rest)) << c.words;
     }
     order(kSyslog, "5003");
     EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5003"));
@@ -412,7 +401,7 @@ TEST_F(Streams, MayFailToBegin)
     order(kSyslog, "5004");
     accept_bare(no_tls).reset();
     EXPECT_TRUE(daemon_->logs("vex_open_ssl: SSL connect error "));
-    EXPECT_TRUE(settles(rest));
+    EXPECT_TRUE(daemon_->settles(rest));
     hang_up();
 }
 
@@ -454,7 +443,7 @@ TEST_F(Streams, TakeWhatTheirProgramsWriteToTheEnd)
 {
     prepare_faults();
     call(true, 0);
-    const resources rest = used();
+    const resources rest = daemon_->used();
     const auto send_all = [this](const unique_fd &program, std::size_t len) {
         EXPECT_EQ(static_cast<ssize_t>(len), send(program.get(), feed_.data(), len, MSG_NOSIGNAL));
     };
@@ -483,7 +472,7 @@ TEST_F(Streams, TakeWhatTheirProgramsWriteToTheEnd)
         send_all(program, feed_.size());
         program.reset();
         EXPECT_TRUE(daemon_->logs("log_server_handle_realtimelog:recvcount=0,client close log_type=[0]"));
-        EXPECT_TRUE(settles(rest));
+        EXPECT_TRUE(daemon_->settles(rest));
     }
     tool_link link = start(kSyslog);
     const unique_fd program = connect_program();
@@ -498,13 +487,13 @@ TEST_F(Streams, EndTheirLinksWithTheirErrors)
 {
     prepare_faults();
     call(false, 1000);
-    const resources rest = used();
+    const resources rest = daemon_->used();
     tool_listener other = listen_at("5002");
     let_fail({.call = kFaultSend, .times = 3, .only = 5002});
     order(kSyslog, "5002");
     EXPECT_TRUE(daemon_->logs(") syslog connect "));
     EXPECT_EQ(2, daemon_->logged("log_client_syslog_thread_proc :try send pkg msg "));
-    EXPECT_TRUE(settles(rest));
+    EXPECT_TRUE(daemon_->settles(rest));
     accept_bare(other).reset(); /* nothing was heard of it */
     let_fail({.call = kFaultSend, .times = 2, .only = 5002});
     order(kModem, "5002");
@@ -530,7 +519,7 @@ TEST_F(Streams, EndTheirLinksWithTheirErrors)
     }
     EXPECT_TRUE(daemon_->logs("log_recv_server_msg:recvcount=0,client close fd["));
     EXPECT_TRUE(daemon_->logs("vex_syslog.sh -L -o /logfs -l 7 -s 512 &] System error1"));
-    EXPECT_TRUE(settles(rest));
+    EXPECT_TRUE(daemon_->settles(rest));
     EXPECT_EQ(kOnline, ask(kAskMode));
     hang_up();
 }
