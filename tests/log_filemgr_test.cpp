@@ -2,22 +2,18 @@
 #include "tests/memory_platform.h"
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 namespace
 {
 
 TEST(Files, AreWrittenReadAndRemoved)
 {
-    g_platform = {};
     char dir[] = "/tmp/filesXXXXXX";
     ASSERT_NE(nullptr, mkdtemp(dir));
-    const std::string path = std::string(dir) + "/a";
+    const std::string path = std::string(dir) + "/a", to = path + "b";
     EXPECT_EQ(5, log_write_whole_file(path.c_str(), "12345", 5));
     FILE *file = log_open_file(path.c_str(), kFileAppendReadBinary);
     EXPECT_EQ(3, log_write_file_full(file, "678", 3));
-    EXPECT_EQ(0, log_write_file_full(file, "9", 0));
     EXPECT_EQ(-7, log_write_file_full(file, "9", -7));
     EXPECT_EQ(1, log_sync_file(file));
     EXPECT_EQ(1, log_seek_file(file, -2, 5)); /* any origin but 0 and 1 is the end */
@@ -27,26 +23,38 @@ TEST(Files, AreWrittenReadAndRemoved)
     EXPECT_EQ(1, log_close_file(file));
     EXPECT_EQ(8, log_get_file_size(path.c_str()));
     EXPECT_EQ(0, pel_remove_file(dir));
-    file = log_open_file(path.c_str(), kFileReadBinary);
-    EXPECT_EQ(0, log_write_file_full(file, "9", 1));
-    EXPECT_EQ(1, log_sync_file(file));
-    log_close_file(file);
-    file = log_open_file("/dev/full", kFileWriteBinary);
-    EXPECT_EQ(0, log_write_file_full(file, std::string(9000, 'x').data(), 9000));
-    log_close_file(file);
-    const std::string to = path + "b";
     EXPECT_EQ(1, pel_rename_file(path.c_str(), to.c_str()));
     EXPECT_EQ(8, log_read_whole_file(to.c_str(), text, sizeof text));
     EXPECT_EQ(1, pel_remove_file(to.c_str()));
     EXPECT_EQ(1, pel_remove_file(dir));
-    g_platform.take_log();
-    EXPECT_EQ(1, pel_remove_file(dir));
-    EXPECT_EQ(0, log_get_file_size(dir));
-    EXPECT_EQ("6 log_filemgr pel_remove_file name " + std::string(dir) + "$|6 log_filemgr " + dir +
-                  " not exsit$|6 log_filemgr log_get_file_size get failed$|",
+}
+
+TEST(Files, FailByTheirResult)
+{
+    g_platform = {};
+    FILE *unwritable = log_open_file("/dev/null", kFileReadBinary);
+    EXPECT_EQ(0, log_write_file_full(unwritable, "9", 1));
+    EXPECT_EQ(0, log_sync_file(unwritable)); /* there is nothing to sync */
+    EXPECT_EQ(0, log_seek_file(unwritable, -1, 0));
+    log_close_file(unwritable);
+    FILE *full = log_open_file("/dev/full", kFileWriteBinary);
+    EXPECT_EQ(0, log_write_file_full(full, "9", 1));
+    log_close_file(full);
+    char text[4];
+    EXPECT_EQ(0, log_read_whole_file("/no/file", text, 4) + log_write_whole_file("/no/file", text, 4));
+    EXPECT_EQ(0, pel_rename_file("/no/file", "/no/other"));
+    EXPECT_EQ(nullptr, log_open_file("/dev/null", 8));
+    EXPECT_EQ(0, log_close_file(nullptr) + log_sync_file(nullptr) + log_read_file(nullptr, text, 4));
+    EXPECT_EQ("", g_platform.take_log());
+    EXPECT_EQ(1, pel_remove_file("/no/file"));
+    EXPECT_EQ(0, log_get_file_size("/no/file"));
+    EXPECT_EQ("6 log_filemgr pel_remove_file name /no/file$|6 log_filemgr /no/file not exsit$|6 log_filemgr "
+              "log_get_file_size get failed$|",
+              g_platform.take_log());
+    EXPECT_EQ(0, log_seek_file(nullptr, 0, 0) + pel_remove_file(nullptr) + pel_rename_file(nullptr, "/no/file"));
+    EXPECT_EQ("6 log_filemgr log_seek_file bad input,file pointer is error$|6 log_filemgr pel_remove_file bad input "
+              "para|6 log_filemgr pel_rename_file bad input,filenames pointer are null|",
               g_platform.log);
-    EXPECT_EQ(nullptr, log_open_file(to.c_str(), 8));
-    EXPECT_NE(0, access(to.c_str(), F_OK));
 }
 
 } // namespace

@@ -1,4 +1,3 @@
-#include "protocol/json_memory.h"
 #include "protocol/log_json_codec.h"
 #include "tests/memory_platform.h"
 #include "tests/recording_handlers.h"
@@ -49,23 +48,6 @@ TEST(Dispatch, AnswersEachControlTextAsItsRowSays)
             expected.replace(at, 2, "$|6 log_json_codec ");
         EXPECT_EQ(expected + "|", g_platform.log);
         EXPECT_EQ(c.commands, g_commands);
-    }
-}
-
-TEST(JsonMemory, HoldsEveryTreeWhole)
-{
-    json_memory_install();
-    std::string long_text = "[0";
-    for (int i = 1; i < 900; ++i)
-        long_text += ',' + std::to_string(i); /* more than a thread's area holds */
-    long_text += ']';
-    for (int round = 0; round < 100; ++round) {
-        const json_tree small{cJSON_Parse(R"({"a":"1","b":"2"})")};
-        const json_tree large{cJSON_Parse(long_text.c_str())};
-        char *printed = cJSON_PrintUnformatted(large.get());
-        EXPECT_EQ(long_text, printed);
-        cJSON_free(printed);
-        EXPECT_STREQ("2", cJSON_GetStringValue(cJSON_GetObjectItem(small.get(), "b")));
     }
 }
 

@@ -48,27 +48,6 @@ TEST_F(Reassembly, HandlesFramesSplitAtEveryPosition)
     EXPECT_EQ(kAll, commands);
 }
 
-TEST_F(Reassembly, TellsWhatItWaitsFor)
-{
-    const struct {
-        std::string piece;
-        const char *last_line;
-    } pieces[] = {
-        {kThree + kFour.substr(0, 5), "0 vex_log_manage log_proc_tcp_pkg: recv data too small=30|"},
-        {kFour.substr(5, 18), "log_proc_tcp_pkg: controlLen =13|6 vex_log_manage log_proc_tcp_pkg: continue "
-                              "recv data, Received =23|"},
-        {kFour.substr(23, 1),
-         "log_proc_tcp_pkg: dataLen =0|6 vex_log_manage log_proc_tcp_pkg: continue recv data, Received =24|"},
-        {kFour.substr(24), "6 vex_log_manage log_proc_tcp_pkg: tmp_buf remaining len =[0] $|"},
-    };
-    for (const auto &p : pieces) {
-        feed(p.piece);
-        EXPECT_TRUE(g_platform.log.ends_with(p.last_line)) << g_platform.log;
-    }
-    EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg: tmp_buf remaining len =[5] $|"));
-    EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg:A complete packet of data received  =25|"));
-}
-
 TEST_F(Reassembly, DropsABadFrameAndHandlesTheGoodOneBehindIt)
 {
     EXPECT_EQ(R"(3:{"msgid":"3"}:;4:{"msgid":"4"}:;)",
@@ -84,9 +63,12 @@ TEST_F(Reassembly, StartsAfreshWithThePieceThatWouldFillTheBuffer)
 {
     std::string wrong_tail = kThree;
     wrong_tail.back() = '!';
-    for (const std::string &stuck : {std::string("?"), "#~" + big_endian(0xffffffff), wrong_tail}) {
+    for (const auto &[stuck, why] : {std::pair<std::string, const char *>{"?", "FindHead_pkg,cannot find PKG_HEAD|"},
+                                     {"#~" + big_endian(0xffffffff), "continue recv data, Received =61439|"},
+                                     {wrong_tail, "FindTail_pkg,cannot find PKG_TAIL|"}}) {
         g_platform = {};
         EXPECT_EQ("", feed(stuck + std::string(61439 - stuck.size(), 'x')));
+        EXPECT_TRUE(g_platform.log.ends_with(why)) << g_platform.log.substr(g_platform.log.size() - 200);
         EXPECT_FALSE(g_platform.logged("tmpbuf small"));
         EXPECT_EQ(R"(4:{"msgid":"4"}:;)", feed(kFour));
         EXPECT_TRUE(g_platform.logged("|6 vex_log_manage log_proc_tcp_pkg: tmpbuf small,drop old content.$|"));
