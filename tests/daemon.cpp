@@ -265,6 +265,11 @@ std::string get_nv(const std::string &name)
     return run_command("sed -n 's/^" + name + "=//p' /etc/vex/nvconfig | tr -d '\\n'");
 }
 
+void forget_nv()
+{
+    std::ofstream{kNvFile} << "log_manage_switch=9\n";
+}
+
 void install_program(const std::string &name, const std::string &script)
 {
     std::ofstream("/usr/vex/override/" + name) << "#!/bin/sh\n" << script;

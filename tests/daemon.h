@@ -105,6 +105,8 @@ std::string read_file(const std::string &path);
 /* Sets an item in the device's NV file, as an operator would; an item's value. */
 void set_nv(const std::string &name, const std::string &value);
 std::string get_nv(const std::string &name);
+/* Loses all items but the start counter. */
+void forget_nv();
 
 /* Puts a shell script into the device's path, ahead of the program of that name. */
 void install_program(const std::string &name, const std::string &script);

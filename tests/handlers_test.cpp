@@ -62,18 +62,6 @@ const std::string kInternal = "Fail:Device internal error";
 const std::string kTar = result(R"({"msgid":"1","conf_file":{"totalLength":""})", "Success");
 const std::string kTarFail = result(R"({"msgid":"1","conf_file":{"totalLength":""})", kInternal);
 
-TEST_F(Handlers, LeaveWhatIsNoRequestUnanswered)
-{
-    connect();
-    std::vector<handler_case> cases;
-    for (const char *id : {"1", "4", "5", "6", "7", "8", "11"}) {
-        cases.push_back({R"({"msgid":")" + std::string(id), kOnline, ""});
-        EXPECT_NE(std::string::npos, tool_->ask(R"({"msgid":")" + std::string(id) + "\"}").find(kInternal)) << id;
-    }
-    cases.push_back({R"({"msgid":"8","bsp":{"module_name":"a\u0000;b","level":"1"}})", kOnline, ""});
-    check(cases);
-}
-
 TEST_F(Handlers, SetAndTellTheSystemLogsParameters)
 {
     connect();
@@ -90,8 +78,6 @@ TEST_F(Handlers, SetAndTellTheSystemLogsParameters)
             script + "5 -s 64 &\n"},
            {request("\"\"", "\"\""), reply(stored, "Success"), ""},
            {request("\"5\"", "\"\""), reply(stored, "Success"), ""},
-           {request("5", "\"64\""), reply(empty, kInternal), ""},
-           {request("\"5\"", "64"), reply(empty, kInternal), ""},
            {request("\"5\"", "\"0123456789abcdef\""), reply(empty, kInternal), ""},
            {request("\"5\"", "\"0123456789abcde\""),
             reply(R"("sysloglevel":"5","syslogsize":"0123456789abcde")", "Success"),
@@ -113,11 +99,10 @@ TEST_F(Handlers, CapturePackets)
     connect();
     const auto request = [](const std::string &members) { return R"({"msgid":"5","tcpdump":{)" + members + "}}"; };
     const std::string done = result(R"({"msgid":"5","tcpdump":{"interfaceName":"","Action":""})", "Success");
-    const std::string failed = result(R"({"msgid":"5","tcpdump":{"interfaceName":"","Action":""})", kInternal);
     const std::string stop = "killall tcpdump\n";
     const std::string again = stop + "rm -rf /logfs/*.pcap\n";
-    install_program("killall", "");
-    install_program("tcpdump", "");
+    install_program("killall", "exit 1"); /* there is nothing to stop, */
+    install_program("tcpdump", "exit 1"); /* and nothing to capture from */
     check(
         {{request(R"("interfacename":"wan,lan","Action":"start")"), done,
           again + "tcpdump -i wan0 -s 128 -w /logfs/wan0.pcap &\ntcpdump -i bridge0 -s 128 -w /logfs/bridge0.pcap &\n"},
@@ -125,60 +110,57 @@ TEST_F(Handlers, CapturePackets)
           again + "tcpdump -i usb0 -s 64 -w /logfs/usb0.pcap &\ntcpdump -i  -s 64 -w /logfs/.pcap &\n"
                   "tcpdump -i 0123456789abcde -s 64 -w /logfs/0123456789abcde.pcap &\n"
                   "tcpdump -i lo -s 64 -w /logfs/lo.pcap &\n"},
-         {request(R"("InterfaceName":"lo","Action":"start","TcpdumpLen":"all")"), done,
-          again + "tcpdump -i lo -s 0 -w /logfs/lo.pcap &\n"},
          {request(R"("InterfaceName":"","Action":"end")"), done, stop},
-         {request(R"("InterfaceName":"lo","Action":"restart")"), done, ""},
-         {request(R"("InterfaceName":"lo")"), failed, ""},
-         {request(R"("Action":"end","TcpdumpLen":"1")"), failed, ""}});
+         {request(R"("InterfaceName":"lo","Action":"restart")"), done, ""}});
+    forget_nv();
+    check({{request(R"("InterfaceName":"wan,lo","Action":"start","TcpdumpLen":"all")"), done,
+            stop + "rm -rf /*.pcap\ntcpdump -i  -s 0 -w /.pcap &\ntcpdump -i lo -s 0 -w /lo.pcap &\n"}});
 }
 
 TEST_F(Handlers, KeepModuleLevels)
 {
     const std::string longest(31, 'n');
-    std::string full = "old,1;bad one,2;x,$(reboot);" + longest + ',' + longest + "n;" + "info,info;";
-    set_nv("bsplog_module_level", full);
     const std::string script = "sh /usr/vex/vex_conf/scripts/klog_mod.sh ";
+    set_nv("bsplog_module_level",
+           "old,1;bad one,2;x,$(reboot);" + longest + ',' + longest + "n;info,info;nolevel;;usb,err,more;");
     start();
-    EXPECT_EQ(0u, daemon_->commands().find(script + "old 1\nsh /usr/vex/vex_conf/scripts/vex_syslog.sh "));
-    daemon_.reset();
-    set_nv("bsplog_module_level", "wlan,debug;nolevel;;usb,err,more;");
-    connect();
+    EXPECT_EQ(0u,
+              daemon_->commands().find(script + "old 1\n" + script + "usb err\nsh /usr/vex/vex_conf/scripts/vex_s"));
+    tool_ = std::make_unique<tool_connection>();
     const auto request = [](const std::string &name, const std::string &level) {
         return R"({"msgid":"8","bsp":{"module_name":")" + name + R"(","level":")" + level + "\"}}";
     };
     const auto reply = [](const std::string &name, const std::string &level, const std::string &said) {
         return result(R"({"msgid":"8","bsp":{"module_name":")" + name + R"(","level":")" + level + "\"}", said);
     };
+    const auto set = [&](const std::string &name, const std::string &level) {
+        return handler_case{request(name, level), reply(name, level, "Success"), script + name + ' ' + level + '\n'};
+    };
     const std::string refused = reply("", "", "Fail:parameter error");
+    set_nv("bsplog_module_level", "wlan,debug;nolevel;;usb,err,more;");
     check({{request("usb", ""), reply("usb", "err", "Success"), ""},
-           {request("never", ""), reply("never", "info", "Success"), ""},
            {request("nolevel", ""), reply("nolevel", "info", "Success"), ""},
            {request("", "debug"), reply("", "", "Fail:unkonw bsp module name"), ""},
            {request("a;reboot", ""), refused, ""},
+           {request("a\\u0000;b", "1"), kOnline, ""},
            {request("wlan", "$(id)"), refused, ""},
            {request(longest + "n", "1"), refused, ""},
-           {R"({"msgid":"8","bsp":{"level":"1"}})", reply("", "", kInternal), ""}});
-    EXPECT_EQ("wlan,debug;nolevel;;usb,err,more;", get_nv("bsplog_module_level"));
-    check({{request("usb", "info"), reply("usb", "info", "Success"), script + "usb info\n"},
-           {request(longest, "2"), reply(longest, "2", "Success"), script + longest + " 2\n"}});
+           set("usb", "info"),
+           set(longest, "2")});
     EXPECT_EQ("wlan,debug;usb,info;" + longest + ",2;", get_nv("bsplog_module_level"));
     EXPECT_EQ("2\n", read_file("/run/vex/klog/" + longest));
     /* 32 entries count, and 1023 characters. */
-    full.clear();
+    std::string full;
     for (int i = 0; i < 33; ++i)
         full += 'm' + std::to_string(i) + ",1;";
     set_nv("bsplog_module_level", full);
-    check({{request("m32", ""), reply("m32", "info", "Success"), ""},
-           {request("new", "1"), reply("new", "1", "Success"), script + "new 1\n"}});
+    check({{request("m32", ""), reply("m32", "info", "Success"), ""}, set("new", "1")});
     EXPECT_EQ(full.substr(0, full.find("m32")) + "new,1;", get_nv("bsplog_module_level"));
     full.clear();
     for (int i = 0; i < 16; ++i)
         full.append(28, static_cast<char>('a' + i)).append(1, ',').append(30, '1').append(1, ';');
-    full += "x," + std::string(1023 - full.size() - 3, '1') + ';';
-    set_nv("bsplog_module_level", full);
-    check(
-        {{request("x", "2"), reply("x", "2", "Success"), script + "x 2\n"}, {request(longest, longest), refused, ""}});
+    set_nv("bsplog_module_level", full + "x," + std::string(1023 - full.size() - 3, '1') + ';');
+    check({set("x", "2"), {request(longest, longest), refused, ""}});
 }
 
 TEST_F(Handlers, UnpackAPackageAndStartItsScript)
@@ -214,8 +196,6 @@ TEST_F(Handlers, UnpackAPackageAndStartItsScript)
     EXPECT_EQ(kTar, push("10", "0123456789a"));
     EXPECT_EQ(kTar, push("0", "bcdef"));
     EXPECT_EQ("0123456789abcdef", read_file("/logfs/logconf.tar"));
-    EXPECT_EQ(kTarFail, tool_->ask(R"({"msgid":"1","conf_file":{"totalLength":10}})", "x"));
-    EXPECT_EQ(kTarFail, tool_->ask(R"({"msgid":"1","conf_file":"10"})", "x"));
     EXPECT_EQ("", daemon_->commands());
     /* No room, then no file to append to. */
     run_command("mount -t tmpfs -o size=64k small /logfs");
@@ -277,8 +257,7 @@ TEST_F(Handlers, SendTheLogArchive)
         EXPECT_EQ(makes_room, daemon_->commands().find("rm -rf /logfs/syslog*\nsh ") == 0) << used;
     }
     check({{R"({"msgid":"7","CleanLocalLog":"no"})", R"({"msgid":"7","CleanLocalLog":"","Result":"Success"})",
-            "rm -rf /logfs/*\n"},
-           {R"({"msgid":"7","CleanLocalLog":1})", result(R"({"msgid":"7","CleanLocalLog":"")", kInternal), ""}});
+            "rm -rf /logfs/*\n"}});
 }
 
 /* A tool that orders an archive and is replaced in the middle of it: the next one gets a whole one of its own. */
@@ -329,9 +308,12 @@ TEST_F(Handlers, StreamTheSystemLogToTheTool)
         EXPECT_EQ(stream_reply("udp", "1514", c.device), tool_->ask(stream_request("syslog", "start")));
         EXPECT_EQ("killall -9 syslogd\nsyslogd -R " + std::string(c.target) + ":1514 &\n", daemon_->commands());
     }
-    check({{stream_request("syslog", "stop"), "", ""},
-           {stream_request("Syslog", "start"), "", ""},
-           {R"({"msgid":"6","realtimeLog":{"LogType":"syslog"}})", stream_reply("", "0", "", kInternal), ""}});
+    check({{stream_request("syslog", "stop"), "", ""}, {stream_request("Syslog", "start"), "", ""}});
+    forget_nv();
+    check({{stream_request("syslog", "start"), stream_reply("udp", "1514", ""),
+            "killall -9 syslogd\nsyslogd -R [0:0:0:0:0:0:0:1]:1514 &\n"},
+           {stream_request("syslog", "end"), stream_reply("udp", "0", ""),
+            "killall -9 syslogd\nsh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o  -l  -s  &\n"}});
 }
 
 TEST_F(Handlers, StreamTheModemLogFromTheDevice)
