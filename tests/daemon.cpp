@@ -13,7 +13,6 @@
 #include <poll.h>
 #include <sstream>
 #include <sys/inotify.h>
-#include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <thread>
@@ -23,21 +22,6 @@ namespace
 
 constexpr char kLogFile[] = "/tmp/daemon.log";
 constexpr char kNvFile[] = "/etc/vex/nvconfig";
-
-constexpr char kFaultFile[] = "/tmp/faults";
-
-fault_board *g_faults; /* null until faults are prepared */
-
-/* In the daemon's process, before it becomes the daemon. */
-void set_faults_up()
-{
-    if (g_faults == nullptr)
-        return;
-    const char *const set = getenv("ASAN_OPTIONS");
-    setenv("ASAN_OPTIONS", ((set != nullptr ? set : "") + std::string(":verify_asan_link_order=0")).c_str(), 1);
-    setenv("VEX_FAULTS", kFaultFile, 1);
-    setenv("LD_PRELOAD", "/usr/vex/libexec/libfaults.so", 1);
-}
 
 bool readable(int fd, int milliseconds = kPatience)
 {
@@ -121,7 +105,7 @@ daemon_process::daemon_process(const std::vector<std::string> &arguments, bool s
     dup2(out.get(), 2);
     for (int i = 0; !streams && i <= 2; ++i)
         close(i);
-    set_faults_up();
+    join_faults();
     execvp(argv[0], argv.data());
     _exit(127);
 }
@@ -207,31 +191,6 @@ bool daemon_process::settles(const resources &expected) const
     while (used() != expected && std::chrono::steady_clock::now() < end)
         std::this_thread::yield(); /* the kernel tells nobody when a thread has gone */
     return used() == expected;
-}
-
-void prepare_faults()
-{
-    const unique_fd file{open(kFaultFile, O_RDWR | O_CREAT | O_TRUNC | O_CLOEXEC, 0600)};
-    ASSERT_EQ(0, ftruncate(file.get(), sizeof(fault_board)));
-    void *const shared = mmap(nullptr, sizeof(fault_board), PROT_READ | PROT_WRITE, MAP_SHARED, file.get(), 0);
-    ASSERT_NE(MAP_FAILED, shared);
-    g_faults = static_cast<fault_board *>(shared);
-}
-
-void let_fail(const fault &what)
-{
-    fault_order &order = g_faults->call[what.call];
-    order.fail = 0;
-    order.only = what.only;
-    order.error = what.error;
-    order.pass = what.pass;
-    order.failed = 0;
-    order.fail = what.times;
-}
-
-int failed(fault_call call)
-{
-    return g_faults->call[call].failed;
 }
 
 void Daemon::start(bool streams)

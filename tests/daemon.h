@@ -5,7 +5,7 @@
 #ifndef TESTS_DAEMON_H
 #define TESTS_DAEMON_H
 
-#include "device/faults.h"
+#include "device/fault_orders.h"
 #include "platform/unique_fd.h"
 
 #include <gtest/gtest.h>
@@ -63,22 +63,6 @@ private:
     unique_fd log_changes_;
     std::size_t commands_seen_ = 0;
 };
-
-/* Calls of the daemon that are to fail; what is not given is for any socket, at once, with the usual error. */
-struct fault {
-    fault_call call;
-    int times = 1;
-    int only = 0;
-    int error = 0;
-    int pass = 0;
-};
-
-/* Daemons that start from now on are on a device in trouble; no call fails yet. */
-void prepare_faults();
-/* From now on these calls fail, in place of those that were to fail before. */
-void let_fail(const fault &what);
-/* How many have failed since. */
-int failed(fault_call call);
 
 /* A daemon on its device, and what it had when it was at rest. */
 class Daemon : public testing::Test

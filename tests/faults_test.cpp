@@ -17,7 +17,7 @@ using std::chrono::steady_clock;
 class Faults : public Daemon
 {
 protected:
-    void SetUp() override { prepare_faults(); }
+    void SetUp() override { ASSERT_TRUE(prepare_faults()); }
     /* A tool's port, by which the daemon's calls on its connection are told from others. */
     static int port_of(const tool_connection &tool)
     {

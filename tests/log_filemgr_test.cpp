@@ -6,29 +6,6 @@
 namespace
 {
 
-TEST(Files, AreWrittenReadAndRemoved)
-{
-    char dir[] = "/tmp/filesXXXXXX";
-    ASSERT_NE(nullptr, mkdtemp(dir));
-    const std::string path = std::string(dir) + "/a", to = path + "b";
-    EXPECT_EQ(5, log_write_whole_file(path.c_str(), "12345", 5));
-    FILE *file = log_open_file(path.c_str(), kFileAppendReadBinary);
-    EXPECT_EQ(3, log_write_file_full(file, "678", 3));
-    EXPECT_EQ(-7, log_write_file_full(file, "9", -7));
-    EXPECT_EQ(1, log_sync_file(file));
-    EXPECT_EQ(1, log_seek_file(file, -2, 5)); /* any origin but 0 and 1 is the end */
-    char text[16] = {};
-    EXPECT_EQ(2, log_read_file(file, text, sizeof text));
-    EXPECT_STREQ("78", text);
-    EXPECT_EQ(1, log_close_file(file));
-    EXPECT_EQ(8, log_get_file_size(path.c_str()));
-    EXPECT_EQ(0, pel_remove_file(dir));
-    EXPECT_EQ(1, pel_rename_file(path.c_str(), to.c_str()));
-    EXPECT_EQ(8, log_read_whole_file(to.c_str(), text, sizeof text));
-    EXPECT_EQ(1, pel_remove_file(to.c_str()));
-    EXPECT_EQ(1, pel_remove_file(dir));
-}
-
 TEST(Files, FailByTheirResult)
 {
     g_platform = {};

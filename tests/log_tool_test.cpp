@@ -36,21 +36,6 @@ struct fake_device {
     std::thread thread;
 };
 
-TEST(LogTool, ShowsTheDeviceToPeopleAndScripts)
-{
-    daemon_process daemon;
-    daemon.wait_listening();
-    int status = -1;
-    EXPECT_EQ(0u, run_command("vex_log_tool version --host ::1", &status)
-                      .find("Device at ::1 port 48888\n  model             VX-520\n"));
-    EXPECT_EQ(0, status);
-    EXPECT_EQ(
-        "{\"msgid\":\"11\",\"mode_lpm_online\":\"\",\"Result\":\"Fail:parameter error\"}\n"
-        "vex_log_tool: 127.0.0.1 port 48888 answered \"Fail:parameter error\": it does not take such a value\n",
-        run_command(R"(vex_log_tool --host 127.0.0.1 --json raw '{"msgid":"11","mode_lpm_online":"up"}')", &status));
-    EXPECT_EQ(1, status);
-}
-
 TEST(LogTool, DoesEverythingOnARealDevice)
 {
     daemon_process daemon;
@@ -61,16 +46,16 @@ TEST(LogTool, DoesEverythingOnARealDevice)
         EXPECT_EQ(0, status) << command;
         EXPECT_NE(std::string::npos, out.find(words)) << command << '\n' << out;
     };
+    says("version --host ::1", "Device at ::1 port 48888\n  model             VX-520\n");
     says("syslog", "System log: level 7, size 512 KB, at most 20480 KB\n");
     says("syslog 5 64", "System log: level 5, size 64 KB: the device was told so\n");
     says("bsp usb err", "Kernel module usb: log level err: the device was told so\n");
     says("bsp usb", "Kernel module usb: log level err\n");
-    says("modem", "The modem is set to: online\n");
     says("capture start lan,lo --len 100", "told to capture on lan,lo.");
     says("--json capture start lan,lo",
          R"({"msgid":"5","tcpdump":{"interfaceName":"","Action":""},"Result":"Success"})");
     run_command("until [ -e /logfs/lo.pcap ] && [ -e /logfs/bridge0.pcap ]; do sleep 0.01; done");
-    says("version", "VX-520");
+    says("modem", "The modem is set to: online\n"); /* something to capture */
     run_command("until [ $(stat -c %s /logfs/lo.pcap) -gt 24 ]; do killall -USR2 tcpdump; sleep 0.01; done");
     says("capture stop", "told to stop");
     run_command("while pidof tcpdump; do sleep 0.01; done; head -c 1500000 /dev/urandom >/logfs/noise");
@@ -137,10 +122,8 @@ TEST(LogTool, StoresNothingButWholeArchives)
         {piece(size, good.substr(0, good.size() - 8) + std::string(4, 'c') + good.substr(good.size() - 4)), 1,
          "no whole gzip tar: incorrect data check"},
         {piece(size, good.substr(0, 50)) + piece("9999", good.substr(50)), 1, "do not fit together"},
-        {piece("60", good), 1, "do not fit together"},
         {piece("0", ""), 1, "do not fit together"},
         {piece(size, good.substr(0, 50)), 2, "ended before the answer was there"},
-        {piece("9", "no gzip!!"), 1, "is no whole gzip tar: it is not packed with gzip"},
         {piece("90", good.substr(0, 90)), 1, "is no whole gzip tar: unexpected end of file"},
     };
     for (const auto &c : cases) {
@@ -170,13 +153,9 @@ TEST(LogTool, SaysWhatWentWrongAndWhere)
         {whole, 0, "Device at %"},
         {frame(R"({"msgid":"3","Result":"Fail:x"})"), 1, "% answered \"Fail:x\""},
         {frame(""), 1, "% refused the request"},
-        {frame("no JSON"), 1, "% sent a reply without a result: no JSON"},
         {frame(R"({"msgid":"4","Result":"Success"})"), 1, "% sent the reply to another command"},
         {"220 ready", 2, "what % sent is not a frame"},
         {"", 2, "the connection to % ended before the answer was there"},
-        {whole.substr(0, 20), 2, "another one may have taken it over"},
-        {"HTTP/1.1 400 Bad Request\r\n\r\n", 2, "what % sent is not a frame"},
-        {"#~" + big_endian(2049) + std::string(3000, 'c'), 2, "is not a frame"},
         {whole.substr(0, whole.size() - 1) + "!", 2, "is not a frame"},
         {frame(R"({"msgid":"3","Result":"\u001b[2J\u009b"})"), 1, "answered \"\\x1b[2J\xc2\\x9b\""},
     };

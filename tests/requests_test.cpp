@@ -109,6 +109,24 @@ TEST_F(Requests, AreToldWhenAMemberIsMissing)
     EXPECT_EQ("", ask(6, R"("realtimeLog":{"LogType":"syslog","Action":"stop","ip":"1.1.1.1","port":"1"})"));
 }
 
+TEST_F(Requests, ToConfirmALinkAreTheDevicesOwnServersOnly)
+{
+    g_platform.items["imei"] = "356938035643809";
+    for (const auto &[members, words] : {
+             std::pair{R"("x":{)", "cannot find K_DataLink item"},
+             {R"("datalink":{"imei":"356938035643808","ConnectType":"qxdm_connect")",
+              "imei = [356938035643808] is incorrect"},
+             {R"("datalink":{"ConnectType":"syslog_connect")", "cannot find K_Imei item"},
+             {R"("datalink":{"IMEI":"356938035643809")", "cannot find K_ConnectType item"},
+             {R"("datalink":{"imei":"356938035643809","ConnectType":"SYSLOG_CONNECT")",
+              "unknow ConnectType = [SYSLOG_CONNECT]"},
+         }) {
+        EXPECT_EQ("", ask(10, std::string(members) + "}"));
+        EXPECT_TRUE(g_platform.logged(words)) << g_platform.log;
+        EXPECT_FALSE(g_platform.logged("cmdStr["));
+    }
+}
+
 TEST_F(Requests, AreToldNothingOfAPlatformThatFails)
 {
     const std::string set = R"("bsp":{"module_name":"usb","level":"err"})";
