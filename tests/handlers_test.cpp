@@ -9,6 +9,7 @@
 #include <netinet/in.h>
 #include <sys/socket.h>
 #include <thread>
+#include <tuple>
 
 namespace
 {
@@ -62,35 +63,41 @@ const std::string kInternal = "Fail:Device internal error";
 const std::string kTar = result(R"({"msgid":"1","conf_file":{"totalLength":""})", "Success");
 const std::string kTarFail = result(R"({"msgid":"1","conf_file":{"totalLength":""})", kInternal);
 
+std::string stream_reply(const std::string &protocol, const std::string &port, const std::string &ip,
+                         const std::string &said = "Success")
+{
+    return result(R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":")" + protocol + R"(","port":")" +
+                      port + R"(","ip":")" + ip + "\"}",
+                  said);
+}
+
+std::string stream_request(const std::string &log, const std::string &action)
+{
+    return R"({"msgid":"6","realtimeLog":{"LogType":")" + log + R"(","Action":")" + action + "\"}}";
+}
+
 TEST_F(Handlers, SetAndTellTheSystemLogsParameters)
 {
     connect();
     const auto request = [](const std::string &level, const std::string &size) {
-        return R"({"msgid":"4","SyslogParaSet":{"sysloglevel":)" + level + R"(,"syslogsize":)" + size + "}}";
+        return R"({"msgid":"4","SyslogParaSet":{"sysloglevel":")" + level + R"(","syslogsize":")" + size + "\"}}";
     };
-    const auto reply = [](const std::string &values, const std::string &said) {
+    const auto reply = [](const std::string &values, const std::string &said = "Success") {
         return result(R"({"msgid":"4","syslogParaSet":{)" + values + "}", said);
     };
-    const std::string empty = R"("sysloglevel":"","syslogsize":"")";
-    const std::string stored = R"("sysloglevel":"7","syslogsize":"512","syslogsizeMax":"20480")";
+    const std::string stored = reply(R"("sysloglevel":"7","syslogsize":"512","syslogsizeMax":"20480")");
     const std::string script = "sh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o /logfs -l ";
-    check({{request("\"5\"", "\"64\""), reply(R"("sysloglevel":"5","syslogsize":"64")", "Success"),
-            script + "5 -s 64 &\n"},
-           {request("\"\"", "\"\""), reply(stored, "Success"), ""},
-           {request("\"5\"", "\"\""), reply(stored, "Success"), ""},
-           {request("\"5\"", "\"0123456789abcdef\""), reply(empty, kInternal), ""},
-           {request("\"5\"", "\"0123456789abcde\""),
-            reply(R"("sysloglevel":"5","syslogsize":"0123456789abcde")", "Success"),
+    check({{request("", ""), stored, ""},
+           {request("5", ""), stored, ""},
+           {request("5", "0123456789abcdef"), reply(R"("sysloglevel":"","syslogsize":"")", kInternal), ""},
+           {request("5", "0123456789abcde"), reply(R"("sysloglevel":"5","syslogsize":"0123456789abcde")"),
             script + "5 -s 0123456789abcde &\n"}});
     /* While the log is streamed, the values wait for the stream's end. */
-    const std::string stream = R"({"msgid":"6","realtimeLog":{"LogType":"syslog","Action":")";
-    tool_->ask(stream + "start\"}}");
+    tool_->ask(stream_request("syslog", "start"));
     daemon_->commands();
-    check(
-        {{request("\"3\"", "\"99\""), reply(R"("sysloglevel":"3","syslogsize":"99")", "Success"), ""},
-         {stream + "end\"}}",
-          R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"udp","port":"0","ip":""},"Result":"Success"})",
-          "killall -9 syslogd\n" + script + "3 -s 99 &\n"}});
+    check({{request("3", "99"), reply(R"("sysloglevel":"3","syslogsize":"99")"), ""},
+           {stream_request("syslog", "end"), stream_reply("udp", "0", ""),
+            "killall -9 syslogd\n" + script + "3 -s 99 &\n"}});
     EXPECT_EQ("3 99", get_nv("syslog_level") + ' ' + get_nv("syslog_size"));
 }
 
@@ -225,23 +232,20 @@ std::string fetch(const tool_connection &tool, std::string &last)
 TEST_F(Handlers, SendTheLogArchive)
 {
     connect();
-    run_command("head -c 102400 /dev/urandom >/tmp/two; head -c 51201 /dev/urandom >/tmp/one_more");
     std::string last;
-    for (const char *file : {"/tmp/two", "/tmp/one_more"}) {
-        install_program("tar", "cp " + std::string(file) + " $2");
+    for (const char *size : {"51201", "102400"}) {
+        install_program("tar", "head -c " + std::string(size) + " /dev/urandom >/tmp/packed; cp /tmp/packed $2");
         tool_->send(frame(kGetArchive));
-        EXPECT_EQ(read_file(file), fetch(*tool_, last));
-        EXPECT_EQ(result(R"({"msgid":"2","GetLocalLog":{"totalLength":")" +
-                             std::to_string(std::filesystem::file_size(file)) + "\"}",
-                         "Success"),
+        const std::string fetched = fetch(*tool_, last);
+        EXPECT_TRUE(fetched == read_file("/tmp/packed"));
+        EXPECT_EQ(result(R"({"msgid":"2","GetLocalLog":{"totalLength":")" + std::string(size) + "\"}", "Success"),
                   last);
         EXPECT_EQ(kOnline, tool_->ask(kAskMode));
         EXPECT_EQ("sh /usr/vex/vex_conf/scripts/vex_debug.sh get_status\ntar -czvf /tmp/MBBlogfs.tar.gz /logfs/\n"
                   "rm -rf /tmp/MBBlogfs.tar.gz\n",
                   daemon_->commands());
-        EXPECT_FALSE(exists("/tmp/MBBlogfs.tar.gz"));
     }
-    for (const char *tar : {"cp /tmp/two $2; exit 1", ": >$2", "rm -f $2"}) {
+    for (const char *tar : {"cp /tmp/packed $2; exit 1", ": >$2", "rm -f $2"}) {
         install_program("tar", tar);
         EXPECT_EQ(kNotPacked, tool_->ask(kGetArchive)) << tar;
     }
@@ -278,35 +282,17 @@ TEST_F(Handlers, StopAnArchiveWhoseToolIsReplaced)
     EXPECT_FALSE(exists("/tmp/MBBlogfs.tar.gz"));
 }
 
-std::string stream_reply(const std::string &protocol, const std::string &port, const std::string &ip,
-                         const std::string &said = "Success")
-{
-    return result(R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":")" + protocol + R"(","port":")" +
-                      port + R"(","ip":")" + ip + "\"}",
-                  said);
-}
-
-std::string stream_request(const std::string &log, const std::string &action)
-{
-    return R"({"msgid":"6","realtimeLog":{"LogType":")" + log + R"(","Action":")" + action + "\"}}";
-}
-
 TEST_F(Handlers, StreamTheSystemLogToTheTool)
 {
     install_program("killall", "");
     install_program("syslogd", "");
-    const struct {
-        const char *tool;
-        const char *target;
-        const char *device;
-    } cases[] = {{"192.168.0.1", "192.168.0.1", "192.168.0.1"},
-                 {"127.0.0.1", "127.0.0.1", "10.64.0.2"},
-                 {"::1", "[0:0:0:0:0:0:0:1]", "fd00::2"}};
     connect();
-    for (const auto &c : cases) {
-        tool_ = std::make_unique<tool_connection>(c.tool);
-        EXPECT_EQ(stream_reply("udp", "1514", c.device), tool_->ask(stream_request("syslog", "start")));
-        EXPECT_EQ("killall -9 syslogd\nsyslogd -R " + std::string(c.target) + ":1514 &\n", daemon_->commands());
+    for (const auto &[tool, target, device] : {std::tuple{"192.168.0.1", "192.168.0.1", "192.168.0.1"},
+                                               {"127.0.0.1", "127.0.0.1", "10.64.0.2"},
+                                               {"::1", "[0:0:0:0:0:0:0:1]", "fd00::2"}}) {
+        tool_ = std::make_unique<tool_connection>(tool);
+        check({{stream_request("syslog", "start"), stream_reply("udp", "1514", device),
+                "killall -9 syslogd\nsyslogd -R " + std::string(target) + ":1514 &\n"}});
     }
     check({{stream_request("syslog", "stop"), "", ""}, {stream_request("Syslog", "start"), "", ""}});
     forget_nv();

@@ -9,6 +9,7 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <thread>
+#include <tuple>
 
 namespace
 {
@@ -285,34 +286,29 @@ TEST_F(Streams, MayFailToBegin)
     ASSERT_TRUE(prepare_faults());
     call(true, 1000, "1");
     const resources rest = daemon_->used();
-    const struct {
-        fault what;
-        const char *words;
-        bool calls; /* whether there is a data link all the same */
-    } cases[] = {
-        {{.call = kFaultThread}, "vex_log_recv_syslog_thread  FAIL", true},
-        {{.call = kFaultThread, .pass = 1}, "vex_log_client_syslog_thread  FAIL", false},
-        {{.call = kFaultSocket, .only = AF_UNIX}, "can not create socket. errno: 24", true},
-        {{.call = kFaultBind, .only = AF_UNIX}, "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
-        {{.call = kFaultListen, .only = AF_UNIX}, "can not listen socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
-        {{.call = kFaultAccept, .only = AF_UNIX}, "can not accept client, errno: 24", true},
-        {{.call = kFaultSocket, .only = AF_INET}, "Error calling socket: Too many open files, errno: 24", false},
-    };
     long refused = 0;
-    for (const auto &c : cases) {
+    for (const auto &[what, words, calls] : {
+             std::tuple{fault{.call = kFaultThread}, "vex_log_recv_syslog_thread  FAIL", true},
+             {{.call = kFaultThread, .pass = 1}, "vex_log_client_syslog_thread  FAIL", false},
+             {{.call = kFaultSocket, .only = AF_UNIX}, "can not create socket. errno: 24", true},
+             {{.call = kFaultBind, .only = AF_UNIX}, "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
+             {{.call = kFaultListen, .only = AF_UNIX}, "can not listen socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
+             {{.call = kFaultAccept, .only = AF_UNIX}, "can not accept client, errno: 24", true},
+             {{.call = kFaultSocket, .only = AF_INET}, "Error calling socket: Too many open files, errno: 24", false},
+         }) {
         daemon_->commands();
-        let_fail(c.what);
+        let_fail(what);
         order(kSyslog);
-        EXPECT_TRUE(daemon_->logs(c.words));
-        if (c.calls) {
+        EXPECT_TRUE(daemon_->logs(words));
+        if (calls) {
             tool_link link = accept_link(kSyslog, listener_);
-            EXPECT_TRUE(daemon_->settles({rest.first + 1, rest.second + 1})) << c.words;
+            EXPECT_TRUE(daemon_->settles({rest.first + 1, rest.second + 1})) << words;
             confirm(link, kSyslog); /* its program would have nowhere to write to */
             EXPECT_TRUE(daemon_->logs("can not connect to:/tmp/MSG_ID_SYSLOG, errno: ", ++refused));
             EXPECT_EQ("", daemon_->commands());
         }
         end(kSyslog);
-        EXPECT_TRUE(daemon_->settles(rest)) << c.words;
+        EXPECT_TRUE(daemon_->settles(rest)) << words;
     }
     order(kSyslog, "5003");
     EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5003"));
