@@ -1,10 +1,12 @@
 #include "tests/daemon.h"
 #include "tests/frame.h"
 
+#include <functional>
 #include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
 #include <thread>
+#include <vector>
 
 namespace
 {
@@ -102,6 +104,29 @@ std::string piece(const std::string &total, const std::string &data)
     return frame(R"({"msgid":"2","GetLocalLog":{"totalLength":")" + total + R"("},"Result":"Success"})", data);
 }
 
+struct tool_case {
+    std::string says; /* the device */
+    int status;
+    const char *words;
+};
+
+/* What the tool says of each device, before `after` is run. */
+void check(
+    const std::vector<tool_case> &cases, const std::string &command,
+    const std::function<void(const tool_case &)> &after = [](const tool_case &) {})
+{
+    for (const tool_case &c : cases) {
+        const fake_device device(c.says, false);
+        int status = -1;
+        const std::string at = " --host 127.0.0.1 --port " + device.port;
+        const std::string out = run_command("vex_log_tool " + command + at, &status);
+        EXPECT_EQ(c.status, status) << c.words;
+        EXPECT_NE(std::string::npos, out.find(c.words)) << c.words << '\n' << out;
+        EXPECT_TRUE(c.status == 0 || out.find("127.0.0.1 port " + device.port) != std::string::npos) << out;
+        after(c);
+    }
+}
+
 TEST(LogTool, StoresNothingButWholeArchives)
 {
     const std::string not_packed =
@@ -109,32 +134,22 @@ TEST(LogTool, StoresNothingButWholeArchives)
     run_command("mkdir /tmp/d; echo hello >/tmp/hello; tar -czf /tmp/good.tgz -C /tmp hello");
     const std::string good = read_file("/tmp/good.tgz");
     const std::string size = std::to_string(good.size());
-    const struct {
-        std::string says;
-        int status;
-        const char *words;
-    } cases[] = {
-        {piece(size, good.substr(0, 50)) + piece(size, good.substr(50)), 0, "/tmp/d/a: 1 file\n"},
-        {not_packed + piece(size, good), 0, "most likely a log changed while the logs were packed"},
-        {not_packed + not_packed, 1, "answered \"Fail:Compressed logfs error\": most likely a log"},
-        {frame(R"({"msgid":"2","Result":"Fail:Open log file error"})"), 1, "lost its archive. Try again"},
-        {piece("99999999999", "x"), 1, "do not fit together"},
-        {piece(size, good.substr(0, good.size() - 8) + std::string(4, 'c') + good.substr(good.size() - 4)), 1,
-         "no whole gzip tar: incorrect data check"},
-        {piece(size, good.substr(0, 50)) + piece("9999", good.substr(50)), 1, "do not fit together"},
-        {piece("0", ""), 1, "do not fit together"},
-        {piece(size, good.substr(0, 50)), 2, "ended before the answer was there"},
-        {piece("90", good.substr(0, 90)), 1, "is no whole gzip tar: unexpected end of file"},
-    };
-    for (const auto &c : cases) {
-        const fake_device device(c.says, false);
-        int status = -1;
-        const std::string out =
-            run_command("vex_log_tool archive /tmp/d/a --tries 2 --host 127.0.0.1 --port " + device.port, &status);
-        EXPECT_EQ(c.status, status) << out;
-        EXPECT_NE(std::string::npos, out.find(c.words)) << c.words << '\n' << out;
-        EXPECT_EQ(c.status == 0 ? "a\n" : "", run_command("ls /tmp/d; rm -f /tmp/d/*"));
-    }
+    check(
+        {
+            {piece(size, good.substr(0, 50)) + piece(size, good.substr(50)), 0, "/tmp/d/a: 1 file\n"},
+            {not_packed + piece(size, good), 0, "most likely a log changed while the logs were packed"},
+            {not_packed + not_packed, 1, "answered \"Fail:Compressed logfs error\": most likely a log"},
+            {frame(R"({"msgid":"2","Result":"Fail:Open log file error"})"), 1, "lost its archive. Try again"},
+            {piece("99999999999", "x"), 1, "do not fit together"},
+            {piece(size, good.substr(0, good.size() - 8) + std::string(4, 'c') + good.substr(good.size() - 4)), 1,
+             "no whole gzip tar: incorrect data check"},
+            {piece(size, good.substr(0, 50)) + piece("9999", good.substr(50)), 1, "do not fit together"},
+            {piece("0", ""), 1, "do not fit together"},
+            {piece(size, good.substr(0, 50)), 2, "ended before the answer was there"},
+            {piece("90", good.substr(0, 90)), 1, "is no whole gzip tar: unexpected end of file"},
+        },
+        "archive /tmp/d/a --tries 2",
+        [](const tool_case &c) { EXPECT_EQ(c.status == 0 ? "a\n" : "", run_command("ls /tmp/d; rm -f /tmp/d/*")); });
     const fake_device slow(piece(size, good.substr(0, 50)), true);
     EXPECT_EQ("2 vex_log_tool: interrupted\n",
               run_command("vex_log_tool archive /tmp/d/a --host 127.0.0.1 --port " + slow.port +
@@ -145,30 +160,17 @@ TEST(LogTool, StoresNothingButWholeArchives)
 TEST(LogTool, SaysWhatWentWrongAndWhere)
 {
     const std::string whole = frame(R"({"msgid":"3","Result":"Success"})");
-    const struct {
-        std::string says;
-        int status;
-        const char *words; /* %: the device's address and port */
-    } cases[] = {
-        {whole, 0, "Device at %"},
-        {frame(R"({"msgid":"3","Result":"Fail:x"})"), 1, "% answered \"Fail:x\""},
-        {frame(""), 1, "% refused the request"},
-        {frame(R"({"msgid":"4","Result":"Success"})"), 1, "% sent the reply to another command"},
-        {"220 ready", 2, "what % sent is not a frame"},
-        {"", 2, "the connection to % ended before the answer was there"},
-        {whole.substr(0, whole.size() - 1) + "!", 2, "is not a frame"},
-        {frame(R"({"msgid":"3","Result":"\u001b[2J\u009b"})"), 1, "answered \"\\x1b[2J\xc2\\x9b\""},
-    };
-    for (const auto &c : cases) {
-        const fake_device device(c.says, false);
-        int status = -1;
-        const std::string out = run_command("vex_log_tool --host 127.0.0.1 version --port " + device.port, &status);
-        std::string words = c.words;
-        if (words.find('%') != std::string::npos)
-            words.replace(words.find('%'), 1, "127.0.0.1 port " + device.port);
-        EXPECT_EQ(c.status, status) << c.words;
-        EXPECT_NE(std::string::npos, out.find(words)) << c.words << '\n' << out;
-    }
+    check(
+        {
+            {frame(R"({"msgid":"3","Result":"Fail:x"})"), 1, " answered \"Fail:x\""},
+            {frame(""), 1, " refused the request"},
+            {frame(R"({"msgid":"4","Result":"Success"})"), 1, " sent the reply to another command"},
+            {"220 ready", 2, " sent is not a frame"},
+            {"", 2, " ended before the answer was there"},
+            {whole.substr(0, whole.size() - 1) + "!", 2, "is not a frame"},
+            {frame(R"({"msgid":"3","Result":"\u001b[2J\u009b"})"), 1, "answered \"\\x1b[2J\xc2\\x9b\""},
+        },
+        "version");
     const auto says = [](const std::string &options, const std::string &words) {
         const std::string out = run_command("vex_log_tool version " + options);
         EXPECT_NE(std::string::npos, out.find(words)) << out;
