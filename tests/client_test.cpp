@@ -4,6 +4,7 @@
 #include <fstream>
 #include <sys/syscall.h>
 #include <thread>
+#include <tuple>
 
 namespace
 {
@@ -35,36 +36,29 @@ protected:
 
 TEST_F(Client, ServesTheServerThatItCalls)
 {
-    const struct {
-        const char *name;
-        std::string options;
-        const char *tls_off;
-        const char *address;
-        const char *calls;
-    } cases[] = {
-        {"plain", " --plain", "1", "127.0.0.1", "127.0.0.1 calls: model VX-520, software VX520_V1.4.2_B07, IMEI"},
-        {"tls", kTls, "0", "::1", "::1 calls over TLS: model VX-520"},
-        {"by name", kTls, "", "localhost", " calls over TLS: model VX-520"}};
     run_command("head -c 3000000 /dev/urandom >/logfs/noise; mkdir -p /tmp/p/conf; touch /tmp/p/conf/Diag.cfg; "
                 "tar -cf /tmp/p.tar -C /tmp/p conf");
-    for (const auto &c : cases) {
-        set_nv("log_use_ssl_disable", c.tls_off);
+    for (const auto &[tls_off, options, address, calls] :
+         {std::tuple{"1", std::string(" --plain"), "127.0.0.1", "127.0.0.1 calls: model VX-520, software VX520_V1."},
+          {"0", kTls, "::1", "::1 calls over TLS: model VX-520"},
+          {"", kTls, "localhost", " calls over TLS: model VX-520"}}) {
+        set_nv("log_use_ssl_disable", tls_off);
         start_server("printf 'version\\nbsp usb err\\narchive /tmp/a.tgz\\nmodem\\nconfig /tmp/p.tar\\nstream qxdm "
                      "--for 0.5 --output /tmp/modem.log\\n' | "
                      "vex_log_tool serve --listen 5000" +
-                     c.options);
-        daemon_process daemon({"-a", c.address, "-p", "5000x", "-r", "3"});
+                     options);
+        daemon_process daemon({"-a", address, "-p", "5000x", "-r", "3"});
         EXPECT_EQ("0\n", server_status()) << server_said();
         EXPECT_EQ(0, daemon.wait_exit());
         const std::string said = server_said();
-        for (const char *words : {c.calls, "IMEI              356938035643809\n", "usb: log level err: the device was",
+        for (const char *words : {calls, "IMEI              356938035643809\n", "usb: log level err: the device was",
                                   "Log archive stored as", "set to: online\n", "taken the package of 10240 bytes",
                                   " kB of the log received."})
-            EXPECT_NE(std::string::npos, said.find(words)) << c.name << ' ' << words << '\n' << said;
-        EXPECT_EQ("", run_command("tar -xOzf /tmp/a.tgz logfs/noise | cmp - /logfs/noise")) << c.name;
+            EXPECT_NE(std::string::npos, said.find(words)) << words << '\n' << said;
+        EXPECT_EQ("", run_command("tar -xOzf /tmp/a.tgz logfs/noise | cmp - /logfs/noise"));
         EXPECT_EQ("DIAG", run_command("head -c 4 /tmp/modem.log; rm /tmp/modem.log"));
         EXPECT_EQ(1, daemon.logged("vex_log_manage exit "));
-        EXPECT_EQ(c.tls_off == std::string("1") ? 0 : 2, daemon.logged("very good ,log_server check ok "));
+        EXPECT_EQ(*tls_off == '1' ? 0 : 2, daemon.logged("very good ,log_server check ok "));
         EXPECT_EQ(0, daemon.logged("log_server_thread_proc"));
     }
 }
@@ -76,61 +70,49 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
     const std::string sign =
         "cd /tmp/c; rm -f db*; touch db; echo 01 >serial; openssl ca -batch -config ca.cnf -cert ca.crt "
         "-keyfile ca.key -in server.csr -out bad.crt -notext ";
-    const struct {
-        std::string make;
-        const char *options;
-        bool accepted;
-    } cases[] = {
-        {sign + "-days 30", "-tls1_2", true}, /* it asks for none of ours, too */
-        {sign + "-days 30", "-tls1_3", true},
-        {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", false},
-        {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", false},
-        {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "", false},
-        {device_program("certificates") + " /tmp/o; cp /tmp/c/ca.crt " + kCertDir +
-             "logca_cert.crt; cp /tmp/o/server.crt /tmp/c/bad.crt; cp /tmp/o/server.key /tmp/c",
-         "", false},
-    };
-    for (const auto &c : cases) {
-        run_command(c.make + "; rm -f /tmp/daemon.log");
+    for (const auto &[make, options, accepted] :
+         {std::tuple{sign + "-days 30", "-tls1_2", true}, /* it asks for none of ours, too */
+          {sign + "-days 30", "-tls1_3", true},
+          {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", false},
+          {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", false},
+          {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "", false},
+          {device_program("certificates") + " /tmp/o; cp /tmp/c/ca.crt " + kCertDir +
+               "logca_cert.crt; cp /tmp/o/server.crt /tmp/c/bad.crt; cp /tmp/o/server.key /tmp/c",
+           "", false}}) {
+        run_command(make + "; rm -f /tmp/daemon.log");
         start_server(
             "until grep -q ControlLink /tmp/said || grep -q 'connect error' /tmp/daemon.log; do sleep 0.01; done | "
             "openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/bad.crt "
             "-key /tmp/c/server.key 2>/dev/null " +
-            std::string(c.options));
+            std::string(options));
         daemon_process daemon({"-a", "127.0.0.1", "-p", "5000", "-r", "3"});
         EXPECT_EQ(0, daemon.wait_exit());
         server_status();
-        EXPECT_EQ(c.accepted, server_said().find("ControlLink") != std::string::npos) << c.make << server_said();
-        EXPECT_EQ(c.accepted ? 0 : 1, daemon.logged("vex_open_ssl: SSL connect error ")) << c.make;
-        EXPECT_EQ(c.accepted ? 0 : 1, daemon.logged("fail connect to address: 127.0.0.1, port number: 5000"));
+        EXPECT_EQ(accepted, server_said().find("ControlLink") != std::string::npos) << make << server_said();
+        EXPECT_EQ(accepted ? 0 : 1, daemon.logged("vex_open_ssl: SSL connect error ")) << make;
+        EXPECT_EQ(accepted ? 0 : 1, daemon.logged("fail connect to address: 127.0.0.1, port number: 5000"));
         EXPECT_EQ(1, daemon.logged("Trying to connect")) << "a session is not tried again";
     }
 }
 
 TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
 {
-    const struct {
-        std::string spoil;
-        std::string words;
-        int status;
-        bool why; /* whether the library's own words are printed */
-    } cases[] = {
-        {"mv logca_cert.crt x", "Failed to load CA file /usr/vex/vex_conf/logcert/logca_cert.crt", 1, false},
-        {"mv x logca_cert.crt; echo >logclient_cert.crt",
-         "Failed to load user certificate file /usr/vex/vex_conf/logcert/logclient_cert.crt", 1, true},
-        {"cp /tmp/c/device.crt logclient_cert.crt; echo >logkey.pem", "[ERROR]use private key fail!", 1, true},
-        {"cp /tmp/c/server.key logkey.pem", "[ERROR]use private key fail!", 1, true},
-        {"echo openssl_conf=o '[o]' providers=p '[p]' null=n '[n]' activate=1 | tr ' ' '\\n' >/tmp/none.cnf",
-         "**SOCKET: Create SSL_CTX error...", 255, true},
-    };
     setenv("OPENSSL_CONF", "/tmp/none.cnf", 1); /* in the end, TLS without its algorithms */
-    for (const auto &c : cases) {
-        run_command(std::string("cd ") + kCertDir + "; " + c.spoil);
+    for (const auto &[spoil, words, status, why] :
+         {std::tuple{"mv logca_cert.crt x", "Failed to load CA file /usr/vex/vex_conf/logcert/logca_cert.crt", 1,
+                     false},
+          {"mv x logca_cert.crt; echo >logclient_cert.crt",
+           "Failed to load user certificate file /usr/vex/vex_conf/logcert/logclient_cert.crt", 1, true},
+          {"cp /tmp/c/device.crt logclient_cert.crt; echo >logkey.pem", "[ERROR]use private key fail!", 1, true},
+          {"cp /tmp/c/server.key logkey.pem", "[ERROR]use private key fail!", 1, true},
+          {"echo openssl_conf=o '[o]' providers=p '[p]' null=n '[n]' activate=1 | tr ' ' '\\n' >/tmp/none.cnf",
+           "**SOCKET: Create SSL_CTX error...", 255, true}}) {
+        run_command(std::string("cd ") + kCertDir + "; " + spoil);
         daemon_process daemon({"-a", "127.0.0.1"});
-        EXPECT_EQ(c.status, daemon.wait_exit()) << c.spoil;
-        EXPECT_EQ(1, daemon.logged(" 0 vex_log_manage")) << c.spoil;
-        EXPECT_EQ(1, daemon.logged(c.words)) << daemon.log();
-        EXPECT_EQ(c.why, read_file("/tmp/daemon.out").find(":error:") != std::string::npos) << c.spoil;
+        EXPECT_EQ(status, daemon.wait_exit()) << spoil;
+        EXPECT_EQ(1, daemon.logged(" 0 vex_log_manage")) << spoil;
+        EXPECT_EQ(1, daemon.logged(words)) << daemon.log();
+        EXPECT_EQ(why, read_file("/tmp/daemon.out").find(":error:") != std::string::npos) << spoil;
         EXPECT_EQ(0, daemon.logged("log_client_ctl_thread_proc"));
     }
 }
@@ -139,31 +121,27 @@ TEST_F(Client, EndsWithItsServerWheneverThatIs)
 {
     const std::string refuses = "sleep 9 | timeout 1 openssl s_server -accept 5000 -cert /tmp/c/server.crt -key "
                                 "/tmp/c/server.key -Verify 1 -verify_return_error -CAfile /tmp/c/server.crt ";
-    const struct {
-        std::string server;
-        const char *tls_off;
-        const char *words;
-    } cases[] = {
-        {"true | busybox nc -l -p 5000 -w 1", "0", "vex_open_ssl: SSL connect error "},
-        {"echo 'no TLS' | busybox nc -l -p 5000", "0", "vex_open_ssl: SSL connect error "},
-        {refuses + "-tls1_2", "0", "vex_open_ssl: SSL connect error "},
-        {refuses + "-tls1_3", "0", "recvfrom error,errno msg="},
-        {"until grep -q calls /tmp/said; do sleep 0.01; done | vex_log_tool serve --listen 5000" + kTls, "0",
-         "recvcount=0,client close"},
-        {"head -c 9000000 /dev/zero >/logfs/zero; printf 'archive /tmp/f/x\n' | vex_log_tool serve --listen 5000" +
-             kTls,
-         "0", "recvcount=0,client close"},
-        {"printf '#~\\0\\0\\0\\036{\"msgid' | timeout 1 busybox nc -l -p 5000", "1", "recv data len =13"},
-        {"printf 'archive /dev/full/x\\n' | vex_log_tool serve --listen 5000 --plain", "1", "recvcount=0,client close"},
-    };
     run_command("mkdir /tmp/f && mount -t tmpfs -o size=100k none /tmp/f"); /* full before an archive has come */
-    for (const auto &c : cases) {
-        set_nv("log_use_ssl_disable", c.tls_off);
-        start_server(c.server);
+    for (const auto &[server, tls_off, words] :
+         {std::tuple{std::string("true | busybox nc -l -p 5000 -w 1"), "0", "vex_open_ssl: SSL connect error "},
+          {std::string("echo 'no TLS' | busybox nc -l -p 5000"), "0", "vex_open_ssl: SSL connect error "},
+          {refuses + "-tls1_2", "0", "vex_open_ssl: SSL connect error "},
+          {refuses + "-tls1_3", "0", "recvfrom error,errno msg="},
+          {"until grep -q calls /tmp/said; do sleep 0.01; done | vex_log_tool serve --listen 5000" + kTls, "0",
+           "recvcount=0,client close"},
+          {"head -c 9000000 /dev/zero >/logfs/zero; printf 'archive /tmp/f/x\n' | vex_log_tool serve --listen 5000" +
+               kTls,
+           "0", "recvcount=0,client close"},
+          {std::string("printf '#~\\0\\0\\0\\036{\"msgid' | timeout 1 busybox nc -l -p 5000"), "1",
+           "recv data len =13"},
+          {std::string("printf 'archive /dev/full/x\\n' | vex_log_tool serve --listen 5000 --plain"), "1",
+           "recvcount=0,client close"}}) {
+        set_nv("log_use_ssl_disable", tls_off);
+        start_server(server);
         daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
-        EXPECT_EQ(0, daemon.wait_exit()) << c.server;
-        EXPECT_NE(0, daemon.logged(c.words)) << c.server << daemon.log();
-        EXPECT_EQ(1, daemon.logged("vex_log_manage exit ")) << c.server;
+        EXPECT_EQ(0, daemon.wait_exit()) << server;
+        EXPECT_NE(0, daemon.logged(words)) << server << daemon.log();
+        EXPECT_EQ(1, daemon.logged("vex_log_manage exit ")) << server;
         server_status();
     }
 }
@@ -172,26 +150,23 @@ TEST_F(Client, EndsWithoutAServerToCall)
 {
     const std::string failed_line = "fail connect to address: ";
     const std::string none_there = "Error is ECONNREFUSED - No one is listening on the remote ip address";
-    const struct {
-        const char *address;
-        const char *tries;
-        std::vector<std::string> words;
-        long failures; /* lines that say so in the end */
-    } cases[] = {
-        {"127.0.0.1", "0", {"Trying to connect to address: 127.0.0.1, port: 0", failed_line}, 1},
-        {"127.0.0.1", "-1", {failed_line + "127.0.0.1, port number: 0"}, 1},
-        {"127.0.0.1", "1", {"Error calling connect: Connection refused, errno: 111", none_there}, 1},
-        {"8.8.8.8", "1", {"Network is unreachable,errno: 101 Re-trying ...", failed_line + "8.8.8.8, port"}, 1},
-        {"fe80::1", "9", {"Error calling connect: Invalid argument, errno: 22", "Invalid argument.  Exiting... "}, 0},
-        {"", "9", {"getaddrinfo error: -2, ", "getaddrinfo did not return list of addrinfo structures."}, 0},
-    };
     run_command("sed -i /^log_server_port=/d /etc/vex/nvconfig");
-    for (const auto &c : cases) {
-        const daemon_process daemon({"-a", c.address, "-r", c.tries});
+    using strings = std::vector<std::string>;
+    for (const auto &[address, tries, lines, failures] :
+         {std::tuple{"127.0.0.1", "0", strings{"Trying to connect to address: 127.0.0.1, port: 0", failed_line}, 1},
+          {"127.0.0.1", "-1", strings{failed_line + "127.0.0.1, port number: 0"}, 1},
+          {"127.0.0.1", "1", strings{"Error calling connect: Connection refused, errno: 111", none_there}, 1},
+          {"8.8.8.8", "1", strings{"Network is unreachable,errno: 101 Re-trying ...", failed_line + "8.8.8.8, port"},
+           1},
+          {"fe80::1", "9",
+           strings{"Error calling connect: Invalid argument, errno: 22", "Invalid argument.  Exiting... "}, 0},
+          {"", "9", strings{"getaddrinfo error: -2, ", "getaddrinfo did not return list of addrinfo structures."},
+           0}}) {
+        const daemon_process daemon({"-a", address, "-r", tries});
         EXPECT_TRUE(daemon.logs("vex_log_manage exit "));
-        for (const std::string &words : c.words)
+        for (const std::string &words : lines)
             EXPECT_EQ(1, daemon.logged(words)) << words << daemon.log();
-        EXPECT_EQ(c.failures, daemon.logged(failed_line)) << c.address;
+        EXPECT_EQ(failures, daemon.logged(failed_line)) << address;
     }
     set_nv("log_manage_mode", "7");
     daemon_process daemon({"-p", "5000"});

@@ -21,18 +21,27 @@ namespace
 {
 
 constexpr char kLogFile[] = "/tmp/daemon.log";
-constexpr char kNvFile[] = "/etc/vex/nvconfig";
 
-bool readable(int fd, int milliseconds = kPatience)
+bool readable(int fd, int milliseconds)
 {
     pollfd entry{fd, POLLIN, 0};
     return poll(&entry, 1, std::max(milliseconds, 0)) == 1;
 }
 
-bool receive_exactly(int fd, std::size_t count, std::string &out)
+/* So many bytes; none when the peer has closed. */
+std::string receive_all(int fd, std::size_t count)
 {
-    out.assign(count, '\0');
-    return count == 0 || (readable(fd) && recv(fd, out.data(), count, MSG_WAITALL) == static_cast<ssize_t>(count));
+    std::string out(count, '\0');
+    out.resize(count == 0 || recv(fd, out.data(), count, MSG_WAITALL) == static_cast<ssize_t>(count) ? count : 0);
+    return out;
+}
+
+/* The length that is held there; 0 without one. */
+std::size_t length_at(const std::string &bytes, std::size_t at)
+{
+    std::uint32_t n = 0;
+    bytes.copy(reinterpret_cast<char *>(&n), sizeof n, std::min(at, bytes.size()));
+    return ntohl(n);
 }
 
 } // namespace
@@ -50,6 +59,8 @@ tool_connection::tool_connection(const char *address)
     addrinfo *to = nullptr;
     EXPECT_EQ(0, getaddrinfo(address, "48888", nullptr, &to));
     fd.reset(socket(to->ai_family, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const timeval patience{kPatience / 1000, 0};
+    setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
     int result = -1;
     /* The daemon's last word before it listens is a log line, a moment ahead of the call. */
     for (int i = 0; i < 100000 && (result = connect(fd.get(), to->ai_addr, to->ai_addrlen)) != 0; ++i)
@@ -65,19 +76,15 @@ void tool_connection::send(const std::string &bytes) const
 
 std::string tool_connection::receive(std::string *data) const
 {
-    const auto number = [](const std::string &s) {
-        std::uint32_t n = 0;
-        std::memcpy(&n, s.data(), sizeof n);
-        return ntohl(n);
-    };
-    std::string head, length, control, rest;
-    if (!receive_exactly(fd.get(), 2, head) || !receive_exactly(fd.get(), 4, length) ||
-        !receive_exactly(fd.get(), number(length), control) || !receive_exactly(fd.get(), 4, length) ||
-        !receive_exactly(fd.get(), number(length) + 2, rest))
+    const std::string head = receive_all(fd.get(), 6);
+    const std::string control = receive_all(fd.get(), length_at(head, 2));
+    const std::string length = receive_all(fd.get(), 4);
+    const std::string rest = receive_all(fd.get(), length_at(length, 0) + 2);
+    if (rest.empty())
         return "(closed)";
     if (data != nullptr)
         *data = rest.substr(0, rest.size() - 2);
-    return head == "#~" && rest.ends_with("~#") ? control : "(no frame)";
+    return head.starts_with("#~") && rest.ends_with("~#") ? control : "(no frame)";
 }
 
 std::string tool_connection::ask(const std::string &control, const std::string &data) const
@@ -198,51 +205,4 @@ void Daemon::start(bool streams)
     daemon_ = std::make_unique<daemon_process>(std::vector<std::string>{}, streams);
     daemon_->wait_listening();
     rest_ = daemon_->used();
-}
-
-std::size_t entries(const std::string &dir)
-{
-    const std::filesystem::directory_iterator all(dir);
-    return static_cast<std::size_t>(std::distance(begin(all), end(all)));
-}
-
-std::string read_file(const std::string &path)
-{
-    std::ostringstream text;
-    text << std::ifstream(path).rdbuf();
-    return text.str();
-}
-
-void set_nv(const std::string &name, const std::string &value)
-{
-    run_command("sed -i '/^" + name + "=/d' /etc/vex/nvconfig");
-    std::ofstream(kNvFile, std::ios::app) << name << '=' << value << '\n';
-}
-
-std::string get_nv(const std::string &name)
-{
-    return run_command("sed -n 's/^" + name + "=//p' /etc/vex/nvconfig | tr -d '\\n'");
-}
-
-void forget_nv()
-{
-    std::ofstream{kNvFile} << "log_manage_switch=9\n";
-}
-
-void install_program(const std::string &name, const std::string &script)
-{
-    std::ofstream("/usr/vex/override/" + name) << "#!/bin/sh\n" << script;
-    EXPECT_EQ(0, chmod(("/usr/vex/override/" + name).c_str(), 0755));
-}
-
-std::string run_command(const std::string &command, int *status)
-{
-    FILE *pipe = popen((command + " 2>&1").c_str(), "re");
-    std::string out;
-    for (int c = 0; (c = std::getc(pipe)) != EOF;)
-        out += static_cast<char>(c);
-    const int result = pclose(pipe);
-    if (status != nullptr)
-        *status = WEXITSTATUS(result);
-    return out;
 }

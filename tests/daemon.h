@@ -6,6 +6,7 @@
 #define TESTS_DAEMON_H
 
 #include "device/fault_orders.h"
+#include "device/operator.h"
 #include "platform/unique_fd.h"
 
 #include <gtest/gtest.h>
@@ -16,9 +17,6 @@
 #include <vector>
 
 constexpr int kPatience = 30000; /* milliseconds */
-
-/* How much there is in a folder. */
-std::size_t entries(const std::string &dir);
 
 /* A log tool's connection to 127.0.0.1 or ::1. */
 struct tool_connection {
@@ -83,19 +81,5 @@ protected:
 extern const std::string kAskMode;
 extern const std::string kOnline;
 std::string mode_reply(const std::string &mode, const std::string &result);
-
-std::string read_file(const std::string &path);
-
-/* Sets an item in the device's NV file, as an operator would; an item's value. */
-void set_nv(const std::string &name, const std::string &value);
-std::string get_nv(const std::string &name);
-/* Loses all items but the start counter. */
-void forget_nv();
-
-/* Puts a shell script into the device's path, ahead of the program of that name. */
-void install_program(const std::string &name, const std::string &script);
-
-/* What a command prints, and its exit status. */
-std::string run_command(const std::string &command, int *status = nullptr);
 
 #endif

@@ -84,7 +84,8 @@ TEST_F(Daemon, SwitchesTheModemAndTellsItsMode)
         EXPECT_EQ(reply, tool.ask(R"({"msgid":"11",)" + std::string(member) + "}"));
         std::uint16_t record[518] = {};
         EXPECT_EQ(command != 0 ? 1036 : -1, recv(modem.get(), record, sizeof record, MSG_DONTWAIT)) << member;
-        EXPECT_EQ(std::pair(command, command != 0 ? 23 : 0), std::pair(int{record[0]}, int{record[2]}));
+        EXPECT_EQ(std::tuple(command, command != 0 ? 23 : 0, command != 0 ? 8 : 0),
+                  std::tuple(int{record[0]}, int{record[2]}, int{record[3]}));
     }
     for (int i = 0; i < 30; ++i) /* nobody waits for a modem that has more to do than its queue holds */
         EXPECT_EQ(kOnline, tool.ask(R"({"msgid":"11","mode_lpm_online":"online"})"));

@@ -1,3 +1,4 @@
+#include "device/operator.h"
 #include "platform/vex_platform.h"
 
 #include <atomic>
@@ -6,7 +7,6 @@
 #include <fstream>
 #include <gtest/gtest.h>
 #include <random>
-#include <regex>
 #include <sched.h>
 #include <sstream>
 #include <sys/mman.h>
@@ -32,13 +32,6 @@ protected:
     }
     void TearDown() override { std::filesystem::remove_all(dir_); }
 
-    static std::string read_file(const std::string &path)
-    {
-        std::ostringstream text;
-        text << std::ifstream(path).rdbuf();
-        return text.str();
-    }
-
     static void set(const std::string &name, const std::string &value)
     {
         ASSERT_EQ(1, vex_nvconfig_write(name.c_str(), value.data(), static_cast<int>(value.size())));
@@ -51,32 +44,9 @@ protected:
         return vex_nvconfig_read(name.c_str(), value, sizeof value - 1) == 1 ? value : "(none)";
     }
 
-    /* Name of the item number n. */
-    static std::string item(int n)
-    {
-        std::string name = "item";
-        return name += std::to_string(n);
-    }
-
     std::string dir_;
     std::string nv_;
 };
-
-TEST_F(HostPlatform, NvValuesEndAtTheirLimits)
-{
-    ASSERT_EQ(1, vex_nvconfig_write("cut", "a\n\0cd", 5));
-    ASSERT_EQ(1, vex_nvconfig_write("short", "abcd", 2));
-    EXPECT_EQ("a\n", get("cut")); /* also before it is committed */
-    cfg_save();
-    EXPECT_EQ("cut=a\\n\nshort=ab\n", read_file(nv_));
-    char few[4] = {'x', 'x', 'x', 'x'};
-    set("long", "1234567");
-    EXPECT_EQ(1, vex_nvconfig_read("long", few, 3));
-    EXPECT_EQ(0, vex_nvconfig_read("missing", few, 3));
-    EXPECT_EQ("123x", std::string(few, 4));
-    for (const char *name : {"", "a=b", "#a", "a\nb"})
-        EXPECT_EQ(0, vex_nvconfig_write(name, "x", 1)) << name;
-}
 
 TEST_F(HostPlatform, NvWriteThatFindsNoRoomIsCommittedLater)
 {
@@ -100,7 +70,7 @@ TEST_F(HostPlatform, NvWritersLoseNothingToEachOther)
 {
     const auto write_items = [](int first) {
         for (int n = first; n < first + 25; ++n)
-            set(item(n), std::to_string(n));
+            set(std::to_string(n), std::to_string(n));
     };
     const pid_t child = fork();
     if (child == 0) {
@@ -114,7 +84,7 @@ TEST_F(HostPlatform, NvWritersLoseNothingToEachOther)
     waitpid(child, &status, 0);
     EXPECT_EQ(0, status);
     for (int n = 0; n < 75; ++n)
-        EXPECT_EQ(std::to_string(n), get(item(n)));
+        EXPECT_EQ(std::to_string(n), get(std::to_string(n)));
 }
 
 /* Processes that write one number after another into two items, each killed at some instant. */
@@ -130,15 +100,15 @@ TEST_F(HostPlatform, NvItemsAreOldOrNewWhenKilled)
     /* Lengths differ, so that a mix of two values would show. */
     const auto value = [](int n) { return std::to_string(n) + std::string(static_cast<std::size_t>(n) % 97, 'v'); };
     std::mt19937 random(20261122);
-    set("item0", value(0));
-    set("item1", value(0));
+    set("0", value(0));
+    set("1", value(0));
     for (std::string stored[] = {value(0), value(0)}; shared->done < 1000;) {
         const int first = shared->done + 1;
         const pid_t child = fork();
         if (child == 0) {
             for (int n = first;; ++n) {
                 shared->begun = n;
-                set(item(n % 2), value(n));
+                set(std::to_string(n % 2), value(n));
                 shared->done = n;
             }
         }
@@ -152,7 +122,7 @@ TEST_F(HostPlatform, NvItemsAreOldOrNewWhenKilled)
             stored[n % 2] = value(n);
         for (int i = 0; i < 2; ++i) {
             const bool in_flight = shared->begun > shared->done && shared->begun % 2 == i;
-            const std::string now = get(item(i));
+            const std::string now = get(std::to_string(i));
             ASSERT_TRUE(now == stored[i] || (in_flight && now == value(shared->begun))) << now << ' ' << stored[i];
             stored[i] = now;
         }
@@ -166,9 +136,14 @@ TEST_F(HostPlatform, LogLinesAreLinesWhateverTheyHold)
     vex_syslog_append(7, "log_tools", 1, 84, "above the level");
     vex_syslog_append(6, "log_tools", 3, 84, "%s", std::string(9000, 'x').c_str());
     EXPECT_EQ(EXDEV, errno);
-    EXPECT_EQ("0 vex_log_manage:7 a\\x1b[0m\\x0d\\x0a\\x7f\\x5cb\xc3\xa4|-5\\x0a\n6 log_tools:3 " +
-                  std::string(4095, 'x') + '\n',
-              std::regex_replace(read_file(dir_ + "/log"), std::regex("20[-0-9]{8}T[:0-9]{8}[.][0-9]{6}Z "), ""));
+    std::istringstream lines(read_file(dir_ + "/log"));
+    for (const std::string &expected :
+         {std::string("0 vex_log_manage:7 a\\x1b[0m\\x0d\\x0a\\x7f\\x5cb\xc3\xa4|-5\\x0a"),
+          std::string(4095, 'x').insert(0, "6 log_tools:3 "), std::string()}) {
+        std::string line;
+        std::getline(lines, line);
+        EXPECT_EQ(expected, line.substr(std::min<std::size_t>(line.size(), 28))); /* behind the time */
+    }
 }
 
 } // namespace

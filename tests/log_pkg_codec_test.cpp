@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 #include <memory>
 #include <sys/socket.h>
+#include <tuple>
 #include <vector>
 
 namespace
@@ -48,28 +49,23 @@ TEST_F(Codec, RefusesWhatIsNoFrame)
     const auto patched = [&good](std::size_t at, const std::string &with) {
         return std::string(good).replace(at, with.size(), with);
     };
-    const struct {
-        std::string frame;
-        int result;
-        const char *line;
-    } cases[] = {
-        {good, 0, "log_msg->tailTag=~#$"},
-        {frame(std::string(2048, 'c'), std::string(61439, 'd')), 0, "log_msg->tailTag=~#$"},
-        {"", 1, "log_decode_msg enter$"},
-        {good.substr(0, 11), 1, "log_decode_fill_msg error:wrong para$"},
-        {frame(std::string(2049, 'c')), 1, "log_decode_fill_msg error control len = 2049$"},
-        {patched(2, "\xff\xff\xff\xff"), 1, "log_decode_fill_msg error control len = -1$"},
-        {patched(2, big_endian(9)), 1, "log_decode_fill_msg error controlLen =9$"},
-        {patched(8, big_endian(5)), 1, "log_decode_fill_msg error dataLen =5$"},
-        {patched(8, "\xff\xff\xff\xff"), 1, "log_decode_fill_msg error dataLen =-1$"},
-        {frame("", std::string(61440, 'd')), 1, "log_decode_fill_msg error dataLen =61440$"},
-        {good + "x", 1, "log_decode_fill_msg:error index 18 != len 19$"},
-        {patched(0, "~#"), 2, "log_decode_fill_msg:log_msg->tailTag=~#$"},
-        {patched(16, "#~"), 3, "log_decode_fill_msg:log_msg->tailTag=#~$"},
-    };
-    for (const auto &c : cases) {
-        EXPECT_EQ(c.result, decode(c.frame)) << c.line;
-        EXPECT_TRUE(g_platform.log.ends_with(c.line + std::string("|"))) << c.line;
+    for (const auto &[bytes_of_frame, result, line] : {
+             std::tuple{good, 0, "log_msg->tailTag=~#$"},
+             {frame(std::string(2048, 'c'), std::string(61439, 'd')), 0, "log_msg->tailTag=~#$"},
+             {std::string(), 1, "log_decode_msg enter$"},
+             {good.substr(0, 11), 1, "log_decode_fill_msg error:wrong para$"},
+             {frame(std::string(2049, 'c')), 1, "log_decode_fill_msg error control len = 2049$"},
+             {patched(2, "\xff\xff\xff\xff"), 1, "log_decode_fill_msg error control len = -1$"},
+             {patched(2, big_endian(9)), 1, "log_decode_fill_msg error controlLen =9$"},
+             {patched(8, big_endian(5)), 1, "log_decode_fill_msg error dataLen =5$"},
+             {patched(8, "\xff\xff\xff\xff"), 1, "log_decode_fill_msg error dataLen =-1$"},
+             {frame("", std::string(61440, 'd')), 1, "log_decode_fill_msg error dataLen =61440$"},
+             {good + "x", 1, "log_decode_fill_msg:error index 18 != len 19$"},
+             {patched(0, "~#"), 2, "log_decode_fill_msg:log_msg->tailTag=~#$"},
+             {patched(16, "#~"), 3, "log_decode_fill_msg:log_msg->tailTag=#~$"},
+         }) {
+        EXPECT_EQ(result, decode(bytes_of_frame)) << line;
+        EXPECT_TRUE(g_platform.log.ends_with(line + std::string("|"))) << line;
     }
 }
 

@@ -61,7 +61,7 @@ TEST(LogTool, DoesEverythingOnARealDevice)
     run_command("until [ $(stat -c %s /logfs/lo.pcap) -gt 24 ]; do killall -USR2 tcpdump; sleep 0.01; done");
     says("capture stop", "told to stop");
     run_command("while pidof tcpdump; do sleep 0.01; done; head -c 1500000 /dev/urandom >/logfs/noise");
-    says("archive /tmp/a.tgz", "bytes\n  capture logfs/");
+    says("archive /tmp/a.tgz", "\n  capture logfs/lo.pcap, ");
     EXPECT_EQ("", run_command("killall syslogd; mkdir /tmp/x && tar -xzf /tmp/a.tgz -C /tmp/x && rm /logfs/syslog "
                               "/tmp/x/logfs/syslog && diff -r /logfs /tmp/x/logfs"));
     EXPECT_NE("", run_command("tcpdump -r /logfs/lo.pcap port 48888 2>/dev/null"));

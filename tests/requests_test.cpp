@@ -9,6 +9,7 @@
 
 #include <gtest/gtest.h>
 #include <sys/socket.h>
+#include <tuple>
 
 namespace
 {
@@ -70,39 +71,33 @@ TEST_F(Requests, AreToldWhenAMemberIsMissing)
     const std::string stream = R"("realtimeLog":{"LogType":"","Action":"","protocol":"","port":"0","ip":""})";
     const std::string bsp = R"("bsp":{"module_name":"","level":""})";
     const std::string package = R"("conf_file":{"totalLength":""})";
-    const struct {
-        int msgid;
-        const char *members;
-        const char *missing;
-        std::string reply;
-        int run_mode = 0;
-    } cases[] = {
-        {1, R"("conf_file":"10")", "conf_file", package},
-        {1, R"("conf_file":{"totalLength":10})", "totalLength", package},
-        {4, R"("x":0)", "K_syslogParaSet", syslog},
-        {4, R"("syslogParaSet":{"syslogsize":"64"})", "K_sysloglevel", syslog},
-        {4, R"("SyslogParaSet":{"sysloglevel":"5","syslogsize":64})", "K_syslogsize", syslog},
-        {5, R"("x":0)", "K_tcpdump", capture},
-        {5, R"("tcpdump":{"Action":"end","TcpdumpLen":"1"})", "K_InterfaceName", capture},
-        {5, R"("tcpdump":{"InterfaceName":"lo"})", "K_Action", capture},
-        {6, R"("x":0)", "K_realtimeLog", stream},
-        {6, R"("realtimeLog":{"Action":"end"})", "K_LogType", stream},
-        {6, R"("realtimeLog":{"LogType":"syslog"})", "K_Action", stream},
-        {6, R"("realtimeLog":{"LogType":"syslog","Action":"end","port":"1"})", "K_ip", stream, 1},
-        {6, R"("realtimeLog":{"LogType":"syslog","Action":"end","ip":"1.1.1.1"})", "K_port", stream, 1},
-        {7, R"("CleanLocalLog":1)", "CleanLocalLog", R"("CleanLocalLog":"")"},
-        {8, R"("x":0)", "K_bspLogSet", bsp},
-        {8, R"("bsp":{"level":"1"})", "K_bspModuleName", bsp},
-        {8, R"("bsp":{"module_name":"usb"})", "K_bspModuleLevel", bsp},
-        {11, R"("mode":"lpm")", "mode_lpm_online", R"("mode_lpm_online":"")"},
-        {11, R"("mode_lpm_online":1)", "mode_lpm_online", R"("mode_lpm_online":"")"},
-    };
-    for (const auto &c : cases) {
-        g_daemon.run_mode = c.run_mode;
-        EXPECT_EQ(R"({"msgid":")" + std::to_string(c.msgid) + "\"," + c.reply +
+    const std::string clean = R"("CleanLocalLog":"")", mode = R"("mode_lpm_online":"")";
+    for (const auto &[msgid, members, missing, answer] : {
+             std::tuple{1, R"("conf_file":"10")", "conf_file", package},
+             {1, R"("conf_file":{"totalLength":10})", "totalLength", package},
+             {4, R"("x":0)", "K_syslogParaSet", syslog},
+             {4, R"("syslogParaSet":{"syslogsize":"64"})", "K_sysloglevel", syslog},
+             {4, R"("SyslogParaSet":{"sysloglevel":"5","syslogsize":64})", "K_syslogsize", syslog},
+             {5, R"("x":0)", "K_tcpdump", capture},
+             {5, R"("tcpdump":{"Action":"end","TcpdumpLen":"1"})", "K_InterfaceName", capture},
+             {5, R"("tcpdump":{"InterfaceName":"lo"})", "K_Action", capture},
+             {6, R"("x":0)", "K_realtimeLog", stream},
+             {6, R"("realtimeLog":{"Action":"end"})", "K_LogType", stream},
+             {6, R"("realtimeLog":{"LogType":"syslog"})", "K_Action", stream},
+             {6, R"("realtimeLog":{"LogType":"syslog","Action":"end","port":"1"})", "K_ip", stream},
+             {6, R"("realtimeLog":{"LogType":"syslog","Action":"end","ip":"1.1.1.1"})", "K_port", stream},
+             {7, R"("CleanLocalLog":1)", "CleanLocalLog", clean},
+             {8, R"("x":0)", "K_bspLogSet", bsp},
+             {8, R"("bsp":{"level":"1"})", "K_bspModuleName", bsp},
+             {8, R"("bsp":{"module_name":"usb"})", "K_bspModuleLevel", bsp},
+             {11, R"("mode":"lpm")", "mode_lpm_online", mode},
+             {11, R"("mode_lpm_online":1)", "mode_lpm_online", mode},
+         }) {
+        g_daemon.run_mode = missing == std::string("K_ip") || missing == std::string("K_port") ? 1 : 0;
+        EXPECT_EQ(R"({"msgid":")" + std::to_string(msgid) + "\"," + answer +
                       R"(,"Result":"Fail:Device internal error"})",
-                  ask(c.msgid, c.members));
-        EXPECT_TRUE(g_platform.logged("|6 log_json_codec cannot find " + std::string(c.missing) + " item$|"));
+                  ask(msgid, members));
+        EXPECT_TRUE(g_platform.logged("|6 log_json_codec cannot find " + std::string(missing) + " item$|"));
         EXPECT_FALSE(g_platform.logged("cmdStr["));
     }
     g_daemon.run_mode = 1;

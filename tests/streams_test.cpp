@@ -66,17 +66,20 @@ protected:
         EXPECT_TRUE(tool_listen(listener, why)) << why;
         return listener;
     }
-    static unique_fd accept_bare(const tool_listener &listener)
+    static void await(const tool_listener &listener)
     {
         pollfd entry{listener.fd.get(), POLLIN, 0};
         EXPECT_EQ(1, poll(&entry, 1, kPatience));
+    }
+    static unique_fd accept_bare(const tool_listener &listener)
+    {
+        await(listener);
         return unique_fd{accept4(listener.fd.get(), nullptr, nullptr, SOCK_CLOEXEC)};
     }
     static std::optional<tool_call> accept(const char *msgid, tool_listener &listener)
     {
         std::string why;
-        pollfd entry{listener.fd.get(), POLLIN, 0};
-        EXPECT_EQ(1, poll(&entry, 1, kPatience));
+        await(listener);
         std::optional<tool_call> call =
             tool_take_call(listener, {}, tool_clock::now() + std::chrono::milliseconds(kPatience), why);
         EXPECT_TRUE(call && call->msgid == msgid) << why;

@@ -1,0 +1,63 @@
+#include "device/operator.h"
+
+#include <cstdio>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <sstream>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+namespace
+{
+
+constexpr char kNvFile[] = "/etc/vex/nvconfig";
+
+} // namespace
+
+std::size_t entries(const std::string &dir)
+{
+    const std::filesystem::directory_iterator all(dir);
+    return static_cast<std::size_t>(std::distance(begin(all), end(all)));
+}
+
+std::string read_file(const std::string &path)
+{
+    std::ostringstream text;
+    text << std::ifstream(path).rdbuf();
+    return text.str();
+}
+
+void set_nv(const std::string &name, const std::string &value)
+{
+    run_command("sed -i '/^" + name + "=/d' /etc/vex/nvconfig");
+    std::ofstream(kNvFile, std::ios::app) << name << '=' << value << '\n';
+}
+
+std::string get_nv(const std::string &name)
+{
+    return run_command("sed -n 's/^" + name + "=//p' /etc/vex/nvconfig | tr -d '\\n'");
+}
+
+void forget_nv()
+{
+    std::ofstream{kNvFile} << "log_manage_switch=9\n";
+}
+
+void install_program(const std::string &name, const std::string &script)
+{
+    std::ofstream("/usr/vex/override/" + name) << "#!/bin/sh\n" << script;
+    chmod(("/usr/vex/override/" + name).c_str(), 0755);
+}
+
+std::string run_command(const std::string &command, int *status)
+{
+    FILE *pipe = popen((command + " 2>&1").c_str(), "re");
+    std::string out;
+    for (int c = 0; (c = std::getc(pipe)) != EOF;)
+        out += static_cast<char>(c);
+    const int result = pclose(pipe);
+    if (status != nullptr)
+        *status = WEXITSTATUS(result);
+    return out;
+}
