@@ -29,8 +29,6 @@ protected:
         int ends[2];
         EXPECT_EQ(0, socketpair(AF_UNIX, SOCK_STREAM, 0, ends));
         const unique_fd sender{ends[0]}, receiver{ends[1]};
-        const int size = 200000;
-        setsockopt(ends[0], SOL_SOCKET, SO_SNDBUF, &size, sizeof size);
         const int result =
             log_send_pkg_msg(ends[0], nullptr, control.c_str(), data.data(), static_cast<int>(data.size()));
         std::string got(70000, '?');

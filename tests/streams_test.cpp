@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <fstream>
+#include <future>
 #include <random>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -181,27 +182,19 @@ TEST_F(Streams, BringEveryByteWhileCommandsAreAnswered)
         call(tls, times);
         tool_link links[] = {start(kSyslog), start(kModem)};
         std::atomic<int> running = 2;
-        std::pair<bool, std::size_t> got[2];
-        std::thread readers[2];
+        std::future<void> readers[2];
         daemon_->commands();
         for (std::size_t i = 0; i < 2; ++i) {
             confirm(links[i], i == 0 ? kSyslog : kModem);
-            readers[i] = std::thread([this, &running, &got, &links, i, times] {
-                for (int n = 0; n < times; ++n, change_keys(links[i])) {
-                    const auto [equal, count] = take(links[i], feed_.size());
-                    got[i] = {(n == 0 || got[i].first) && equal, got[i].second + count};
-                }
+            readers[i] = std::async(std::launch::async, [this, &running, &link = links[i], times] {
+                for (int n = 0; n < times; ++n, change_keys(link))
+                    EXPECT_EQ(std::pair(true, feed_.size()), take(link, feed_.size()));
                 --running;
             });
         }
         while (running > 0) {
             EXPECT_EQ(kOnline, ask(kAskMode));
             change_keys(*control_);
-        }
-        for (std::size_t i = 0; i < 2; ++i) {
-            readers[i].join();
-            EXPECT_TRUE(got[i].first);
-            EXPECT_EQ(static_cast<std::size_t>(times) * feed_.size(), got[i].second);
         }
         const std::string commands = daemon_->commands();
         for (const char *line : {"killall -9 syslogd\n", "\nsyslogd -R tcp_fd=", "killall -9 diag_mdlog\n",
