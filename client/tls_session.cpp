@@ -177,7 +177,8 @@ int explained(int result)
 
 bool tls_session_prepare()
 {
-    g_outbox_method = g_tls.BIO_meth_new(g_tls.BIO_get_new_index() | BIO_TYPE_SOURCE_SINK, "outbox");
+    if (g_outbox_method == nullptr) /* there is one for all contexts */
+        g_outbox_method = g_tls.BIO_meth_new(g_tls.BIO_get_new_index() | BIO_TYPE_SOURCE_SINK, "outbox");
     return g_outbox_method != nullptr && g_tls.BIO_meth_set_write(g_outbox_method, write_outbox) == 1 &&
            g_tls.BIO_meth_set_ctrl(g_outbox_method, control_outbox) == 1;
 }

@@ -15,7 +15,7 @@
 
 using tls_clock = std::chrono::steady_clock;
 
-/* To be called once, when the library is loaded and before any session is made; false without memory. */
+/* To be called when the library is loaded and before any session is made; false without memory. */
 bool tls_session_prepare();
 
 /* A session on the connected socket, which becomes non-blocking and stays the caller's; null without memory. */
