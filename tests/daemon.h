@@ -78,8 +78,7 @@ protected:
 };
 
 /* A command that runs no program, and its reply. */
-extern const std::string kAskMode;
-extern const std::string kOnline;
+extern const std::string kAskMode, kOnline;
 std::string mode_reply(const std::string &mode, const std::string &result);
 
 #endif
