@@ -200,6 +200,11 @@ bool daemon_process::settles(const resources &expected) const
     return used() == expected;
 }
 
+long daemon_process::memory() const
+{
+    return std::stol(run_command("sed -n 's/VmRSS:[ \t]*//p' " + proc("status")));
+}
+
 void Daemon::start(bool streams)
 {
     daemon_ = std::make_unique<daemon_process>(std::vector<std::string>{}, streams);

@@ -18,6 +18,13 @@
 
 constexpr int kPatience = 30000; /* milliseconds */
 
+/* Whether a daemon's memory tells of leaks: sanitizers keep books of their own, and what was freed. */
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMemoryIsOurs = false;
+#else
+constexpr bool kMemoryIsOurs = true;
+#endif
+
 /* A log tool's connection to 127.0.0.1 or ::1. */
 struct tool_connection {
     explicit tool_connection(const char *address = "127.0.0.1");
@@ -54,6 +61,7 @@ public:
     resources used() const { return {entries(proc("fd")), entries(proc("task"))}; }
     /* Whether it comes to use just that. */
     bool settles(const resources &expected) const;
+    long memory() const; /* in kB */
 
     pid_t pid = -1;
 

@@ -16,12 +16,6 @@ namespace
 {
 
 constexpr int kFeedSize = 1 << 20;
-/* Sanitizers keep books of their own, and what was freed. */
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-constexpr bool kMemoryIsOurs = false;
-#else
-constexpr bool kMemoryIsOurs = true;
-#endif
 const std::string kImei = "356938035643809";
 
 struct stream {
@@ -157,8 +151,6 @@ protected:
     }
     /* Waits for the device to end a link. */
     bool ended(tool_link &link) const { return take(link, SIZE_MAX).second < SIZE_MAX; }
-    /* Its memory, in kB. */
-    long resident() const { return std::stol(run_command("sed -n 's/VmRSS:[ \t]*//p' " + daemon_->proc("status"))); }
     /* The device's daemon ends with its server. */
     void hang_up()
     {
@@ -262,11 +254,11 @@ TEST_F(Streams, EndAtAnyMoment)
             }
             end(kSyslog);
             end(kModem);
-            memory = i == 9 ? resident() : memory;
+            memory = i == 9 ? daemon_->memory() : memory;
             EXPECT_TRUE((!links[0] || ended(*links[0])) && (!links[1] || ended(*links[1])));
         }
         EXPECT_TRUE(daemon_->settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
-        EXPECT_TRUE(!kMemoryIsOurs || resident() <= memory + 200) << resident() - memory;
+        EXPECT_TRUE(!kMemoryIsOurs || daemon_->memory() <= memory + 200) << daemon_->memory() - memory;
         for (const stream &which : {kSyslog, kModem}) {
             tool_link link = start(which);
             confirm(link, which);

@@ -1,0 +1,46 @@
+/* The device of a soak: its daemon, and whether both are still what they should be. */
+#ifndef SOAK_DEVICE_H
+#define SOAK_DEVICE_H
+
+#include "tests/daemon.h"
+
+#include <optional>
+#include <string>
+#include <vector>
+
+class soak_device
+{
+public:
+    soak_device();
+    /* Starts the daemon, with or without the address of a log server to call, in a process whose calls can fail. */
+    void start(const std::vector<std::string> &arguments);
+    void start_server_mode();
+    /* The daemon has now what it has when nobody wants anything of it. */
+    void rests();
+    void kill() { daemon_.reset(); }
+    bool started() const { return daemon_.has_value(); }
+    /* Waits for the daemon to end by itself; its exit status. */
+    int wait_exit();
+
+    /* Whether the daemon runs; that it does not fails the test. */
+    bool lives() const;
+    /* These fail the test when something is wrong: the daemon is there and answers on both families; it has no more
+     * descriptors and threads than a daemon at rest, and bounded memory; its settings and its log are whole, the latter shown
+     * when something was wrong. */
+    void check_answers();
+    void check_bounds();
+    void check_nv() const;
+    void check_log() const;
+
+    /* Memory of the daemon, in kB. */
+    long memory() const;
+    long memory_most() const { return memory_most_; }
+
+private:
+    std::optional<daemon_process> daemon_;
+    resources rest_;
+    std::string settings_; /* lines of NV items that nobody here changes */
+    long memory_most_ = 0;
+};
+
+#endif
