@@ -117,6 +117,22 @@ TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
     }
 }
 
+TEST_F(Client, AnswersWhatItIsAskedDuringATransfer)
+{
+    run_command("head -c 5000000 /dev/urandom >/logfs/noise");
+    std::string commands = frame(R"({"msgid":"2"})");
+    for (int i = 0; i < 200; ++i)
+        commands += frame(kAskMode);
+    std::ofstream("/tmp/commands") << commands;
+    start_server("{ cat /tmp/commands; until [ $(grep -ao 'online\",\"Result' /tmp/said | wc -l) = 200 ]; do "
+                 "sleep 0.01; done; } | openssl s_server -quiet -naccept 1 -accept 5000 -cert /tmp/c/server.crt "
+                 "-key /tmp/c/server.key -Verify 1 -verify_return_error -CAfile /tmp/c/ca.crt 2>/dev/null");
+    daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+    server_status();
+    EXPECT_EQ(0, daemon.wait_exit());
+    EXPECT_LT(5000000U, server_said().size());
+}
+
 TEST_F(Client, EndsWithItsServerWheneverThatIs)
 {
     const std::string refuses = "sleep 9 | timeout 1 openssl s_server -accept 5000 -cert /tmp/c/server.crt -key "

@@ -252,6 +252,20 @@ TEST_F(Handlers, SendTheLogArchive)
             "rm -rf /logfs/*\n"}});
 }
 
+TEST_F(Handlers, StopAnArchiveWhoseToolIsReplaced)
+{
+    install_program("tar", "head -c 20000000 /dev/zero >$2");
+    connect();
+    tool_->send(frame(kGetArchive) + frame(kGetArchive));
+    std::string piece;
+    tool_->receive(&piece);
+    EXPECT_EQ(51200u, piece.size());
+    EXPECT_EQ(kOnline, tool_connection("::1").ask(kAskMode)) << "and nothing of the archive";
+    EXPECT_EQ(1, daemon_->logged("send data fail"));
+    EXPECT_EQ(0, daemon_->logged("read file all data, complete"));
+    EXPECT_FALSE(exists("/tmp/MBBlogfs.tar.gz"));
+}
+
 TEST_F(Handlers, StreamTheSystemLogToTheTool)
 {
     install_program("killall", "");
