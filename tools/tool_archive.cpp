@@ -99,8 +99,7 @@ fetch_result receive_pieces(tool_device &device, const part_file &out)
         const tool_answer answer = tool_read_answer(frame->control, kMsgid);
         if (answer.verdict != tool_verdict::success)
             return {kDeviceSaidNo, tool_said(device, answer), frame->control,
-                    cJSON_GetStringValue(cJSON_GetObjectItem(answer.root.get(), "Result")) ==
-                        std::string_view(kNotPacked)};
+                    tool_answer_text(answer, nullptr, "Result") == kNotPacked};
         const std::uint64_t announced = total_of(answer);
         if (total == 0 && announced != 0) {
             total = announced;
