@@ -92,6 +92,6 @@ bool tool_check_tar(int fd, tool_packing packing, std::string &contents, std::st
     if (result == ARCHIVE_EOF && n == 0)
         return true;
     const char *error = archive_error_string(reader.get());
-    why = !source->error.empty() || error == nullptr ? source->error : error;
+    why = !source->error.empty() ? source->error : error != nullptr ? error : "its tar is damaged";
     return false;
 }
