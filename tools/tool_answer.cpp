@@ -41,7 +41,7 @@ std::string tool_printable(const std::string &text)
     unsigned char last = 0;
     for (const char c : text) {
         const auto byte = static_cast<unsigned char>(c);
-        const bool second_control = last == 0xc2 && byte < 0xa0; /* U+0080 to U+009F in UTF-8 */
+        const bool second_control = last == 0xc2 && byte >= 0x80 && byte < 0xa0; /* U+0080 to U+009F in UTF-8 */
         if (byte < 0x20 || byte == 0x7f || second_control)
             out.append("\\x").append(1, kHex[byte >> 4]).append(1, kHex[byte & 15]);
         else
