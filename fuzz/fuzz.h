@@ -8,6 +8,7 @@
 #include <cstdlib>
 #include <string>
 #include <string_view>
+#include <unistd.h>
 
 /* One input; always 0. */
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size);
@@ -16,13 +17,21 @@ inline void promise(bool kept, const char *what)
 {
     if (kept)
         return;
-    std::fprintf(stderr, "broken promise: %s\n", what);
+    dprintf(STDERR_FILENO, "broken promise: %s\n", what);
     std::abort();
 }
 
 inline std::string_view text_of(const std::uint8_t *data, std::size_t size)
 {
     return {reinterpret_cast<const char *>(data), size};
+}
+
+/* Takes what stands before the first such character off the input, and the character with it. */
+inline std::string_view take_field(std::string_view &input, char end)
+{
+    const std::string_view field = input.substr(0, input.find(end));
+    input.remove_prefix(field.size() < input.size() ? field.size() + 1 : field.size());
+    return field;
 }
 
 #endif

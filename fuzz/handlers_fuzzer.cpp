@@ -1,66 +1,244 @@
 /*
- * Every handler's control text, on a device whose commands are written down instead of run. The first byte of an input says
- * which mode the daemon is in, the rest is the control text. No command line is longer than its buffer allows, and every
- * reply is a frame with a control text of at most its bound.
+ * Every handler's control text, on a device whose commands are written down instead of run. No command line fills its
+ * buffer, which would mean that it was cut; every request is answered once, by a frame that bears its number and has a
+ * control text of at most its bound; what is uploaded and what is fetched is not changed on its way.
+ *
+ * The first byte of an input says how the device is (see `device`). The rest is up to four control texts, one a line; a
+ * NUL, then NV items, NAME=VALUE, one a line; a NUL, then what programs print.
  */
 #include "core/daemon_state.h"
 #include "core/log_registry.h"
 #include "core/log_streams.h"
 #include "core/log_tools.h"
 #include "fuzz/fuzz.h"
+#include "handlers/handlers.h"
 #include "platform/unique_fd.h"
 #include "protocol/log_json_codec.h"
 #include "protocol/log_pkg_codec.h"
 #include "tests/memory_platform.h"
+#include "transport/log_intake.h"
 
 #include <cerrno>
 #include <cstring>
+#include <fstream>
 #include <memory>
 #include <pthread.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 
 namespace
 {
 
-constexpr std::size_t kCommandMax = 512;
+constexpr std::size_t kCommandMax = 254; /* one less than the buffers of command lines hold */
 constexpr std::size_t kReplyMax = 1023;
+constexpr std::size_t kVersionReplyMax = 2047;
+constexpr int kRequestsMax = 4;
+constexpr char kPackage[] = "/logfs/logconf.tar";
+constexpr char kArchive[] = "/tmp/MBBlogfs.tar.gz";
 
-void check_command(const char *command)
+/* How the device is. */
+struct device_traits {
+    explicit device_traits(unsigned bits)
+        : client_mode((bits & 1) != 0), tls((bits & 3) == 3), has_config((bits & 4) != 0), has_more((bits & 8) != 0),
+          commands_fail((bits & 16) != 0), linked((bits & 32) != 0), brings_data((bits & 64) != 0),
+          platform_fails((bits & 128) != 0)
+    {
+    }
+    bool client_mode;
+    bool tls;        /* in client mode */
+    bool has_config; /* for the modem log */
+    bool has_more;   /* a second such file, a set-up script, an USB network */
+    bool commands_fail;
+    bool linked;      /* the data links stand */
+    bool brings_data; /* the input itself is every request's data part */
+    bool platform_fails;
+};
+
+device_traits g_device{0};
+std::string g_output; /* of the device's programs */
+int g_link = -1;      /* the device's end of the command connection */
+
+void check_command(std::string_view command)
 {
-    promise(std::strlen(command) < kCommandMax, "a command line has room in its buffer");
+    promise(command.size() <= kCommandMax, "a command line has room in its buffer");
 }
 
-/* The device's end of the command connection, and ours. */
-struct connection {
-    connection()
+/* Command lines that a shell is forked for are seen in the log only. */
+void check_line(const char *source, const char *format, va_list args)
+{
+    char text[8192];
+    std::vsnprintf(text, sizeof text, format, args);
+    constexpr std::string_view kBegin = "cmdStr[";
+    constexpr std::string_view kEnd = "]\n";
+    const std::string_view line = text;
+    if (std::strcmp(source, "log_tools") == 0 && line.starts_with(kBegin))
+        check_command(line.substr(kBegin.size(), line.size() - kBegin.size() - kEnd.size()));
+}
+
+std::string content_of(const char *path)
+{
+    std::ifstream in(path, std::ios::binary);
+    return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+/* A place at which a log program can be connected. */
+unique_fd intake(const char *path)
+{
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::strcpy(address.sun_path, path);
+    unlink(path);
+    unique_fd sock{socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK, 0)};
+    promise(bind(sock.get(), reinterpret_cast<const sockaddr *>(&address), sizeof address) == 0 &&
+                listen(sock.get(), 8) == 0,
+            "an intake");
+    return sock;
+}
+
+/* Our end of the command connection, and an archive to be fetched over it. */
+struct tool_end {
+    tool_end()
     {
         int ends[2] = {-1, -1};
         promise(socketpair(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK, 0, ends) == 0, "a socket pair");
-        peer.reset(ends[1]);
-        log_cmd_record_link(ends[0]);
-        device = ends[0];
+        fd.reset(ends[1]);
+        g_link = ends[0];
+        for (int i = 0; i < 60000; ++i)
+            archive += static_cast<char>(i % 251);
+        std::ofstream(kArchive, std::ios::binary) << archive;
     }
-    int device;
-    unique_fd peer;
+    unique_fd fd;
+    const unique_fd intakes[2] = {intake(kSyslogIntake), intake(kQxdmIntake)};
+    std::string archive;
 };
 
-/* Takes the replies off the connection. */
-void check_replies(const connection &link)
+struct reply {
+    std::string control;
+    std::string data;
+};
+
+/* Takes the next reply off the bytes that came. */
+reply take_reply(std::string_view &bytes)
 {
-    static unsigned char bytes[1 << 20];
     static const auto msg = std::make_unique<log_msg>();
+    const auto *const at = reinterpret_cast<const unsigned char *>(bytes.data());
+    promise(bytes.size() >= kPkgMin, "a reply is a frame");
+    const std::uint32_t control_len = log_pkg_get_u32(at + kPkgControlLenAt);
+    promise(control_len <= kPkgControlMax && kPkgMin + control_len <= bytes.size(), "a reply is bounded");
+    const std::size_t len = kPkgMin + control_len + log_pkg_get_u32(at + kPkgControlAt + control_len);
+    log_msg_clear(msg.get());
+    promise(len <= bytes.size() && log_decode_msg(at, len, msg.get()) == 0, "a reply is a whole frame");
+    bytes.remove_prefix(len);
+    return {{msg->control, control_len}, std::string(text_of(msg->data, static_cast<std::size_t>(msg->dataLen)))};
+}
+
+/* Takes the replies to a request of that number off the connection; the control text of the last one. */
+std::string check_replies(const tool_end &tool, int msgid)
+{
+    static unsigned char received[1 << 18];
     std::size_t held = 0;
-    for (ssize_t n = 0; (n = recv(link.peer.get(), bytes + held, sizeof bytes - held, 0)) > 0;)
+    for (ssize_t n = 0; (n = recv(tool.fd.get(), received + held, sizeof received - held, 0)) > 0;)
         held += static_cast<std::size_t>(n);
-    for (std::size_t at = 0; at < held;) {
-        const std::uint32_t control_len = log_pkg_get_u32(bytes + at + kPkgControlLenAt);
-        promise(at + kPkgMin + control_len <= held && control_len <= kReplyMax, "a reply is bounded");
-        const std::uint32_t data_len = log_pkg_get_u32(bytes + at + kPkgControlAt + control_len);
-        const std::size_t len = kPkgMin + control_len + data_len;
-        log_msg_clear(msg.get());
-        promise(at + len <= held && log_decode_msg(bytes + at, len, msg.get()) == 0, "a reply is a frame");
-        at += len;
+    const std::string number = "{\"msgid\":\"" + std::to_string(msgid) + "\",";
+    int count = 0;
+    reply last;
+    std::string data;
+    for (std::string_view bytes = text_of(received, held); !bytes.empty(); ++count) {
+        last = take_reply(bytes);
+        promise(last.control.empty() || last.control.starts_with(number), "a reply bears its request's number");
+        promise(last.control.size() <= (msgid == 3 ? kVersionReplyMax : kReplyMax), "a reply is not too long");
+        data += last.data;
     }
+    const bool answers = msgid >= 1 && msgid <= 11 && msgid != 9 && msgid != 10;
+    promise(count == (answers ? 1 : 0) || (msgid == 2 && count > 1), "a request is answered once");
+    promise(data.empty() || data == tool.archive, "the archive arrives as it is");
+    return last.control;
+}
+
+/* The data links of both streams, while the device is said to have them. */
+class data_links
+{
+public:
+    data_links()
+    {
+        for (log_link &link : links_) {
+            if (!g_device.linked)
+                continue;
+            link.start = log_stream_start(link.stream, "10.0.0.1", 5000);
+            link.fd = socket(AF_UNIX, SOCK_STREAM, 0);
+            promise(log_link_record_session(link) && log_link_record(link), "a link that is wanted stands");
+        }
+    }
+    ~data_links()
+    {
+        for (log_link &link : links_) {
+            log_stream_stop(link.stream);
+            if (link.fd != -1)
+                log_link_close(link);
+        }
+    }
+    data_links(const data_links &) = delete;
+    data_links &operator=(const data_links &) = delete;
+
+private:
+    log_link links_[2] = {{log_stream::syslog, 0}, {log_stream::qxdm, 0}};
+};
+
+int write_link(SSL *, const void *bytes, int len)
+{
+    return static_cast<int>(send(g_link, bytes, static_cast<std::size_t>(len), 0));
+}
+
+void set_up(std::string_view items)
+{
+    g_platform = {};
+    g_platform.takes_line = check_line;
+    g_platform.items["imei"] = "356938035643809";
+    while (!items.empty()) {
+        std::string_view value = take_field(items, '\n');
+        const std::string name(take_field(value, '='));
+        g_platform.items[name] = value;
+    }
+    g_platform.fails = g_device.platform_fails;
+    g_daemon.run_mode = g_device.client_mode ? 1 : 0;
+    g_daemon.use_ssl = g_device.tls ? 1 : 0;
+    g_daemon.ssl_write = write_link;
+    g_daemon.close_ssl = [](SSL *, int) {};
+    g_daemon.syslog_realtime_on = 0;
+    {
+        const log_lock hold{g_takeover_lock};
+        log_cmd_record(g_link, g_platform.items["client_ip"].c_str());
+    }
+    log_cmd_record_session(g_device.tls ? reinterpret_cast<SSL *>(&g_device) : nullptr);
+    log_cmd_serve(g_link);
+}
+
+/* Runs the requests; what they have uploaded. */
+std::string run_requests(const tool_end &tool, std::string_view requests, std::string_view data)
+{
+    std::string uploaded;
+    for (int i = 0; i < kRequestsMax && !requests.empty(); ++i) {
+        const std::string control(take_field(requests, '\n').substr(0, kPkgControlMax));
+        json_tree tree;
+        const int msgid = log_json_get_msgid(control.c_str(), tree);
+        log_dl_msg_handle_cmd(control.c_str(), reinterpret_cast<const unsigned char *>(data.data()),
+                              static_cast<std::int32_t>(data.size()));
+        const bool done = check_replies(tool, msgid).ends_with("\"Result\":\"Success\"}");
+        if (msgid == 1 && done)
+            uploaded += data;
+    }
+    return uploaded;
+}
+
+/* What is left of one input is not for the next one. */
+void clean_up(const tool_end &tool)
+{
+    for (const unique_fd &sock : tool.intakes)
+        while (unique_fd{accept(sock.get(), nullptr, nullptr)})
+            continue;
+    log_msg_set_config_file(R"({"conf_file":{"totalLength":"0"}})", reinterpret_cast<const unsigned char *>(""), 0);
+    check_replies(tool, 1);
+    unlink(kPackage);
 }
 
 } // namespace
@@ -69,16 +247,20 @@ extern "C" {
 int __wrap_system(const char *command)
 {
     check_command(command);
-    return 0;
+    return g_device.commands_fail ? 1 << 8 : 0;
 }
 FILE *__wrap_popen(const char *command, const char *)
 {
     check_command(command);
-    return fopen("/dev/null", "r");
+    return g_output.empty() ? fopen("/dev/null", "r") : fmemopen(g_output.data(), g_output.size(), "r");
 }
 int __wrap_pclose(FILE *stream)
 {
     return fclose(stream);
+}
+int __wrap_access(const char *path, int)
+{
+    return (std::string_view(path).ends_with("/Diag.cfg") ? g_device.has_config : g_device.has_more) ? 0 : -1;
 }
 int __wrap_fork()
 {
@@ -104,16 +286,22 @@ int refuse_thread(log_thread_task *, void *)
 
 int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
 {
-    if (size < 1 || size > kPkgControlMax)
+    if (size < 1)
         return 0;
-    static const connection link;
-    g_platform = {};
-    g_platform.items["imei"] = "356938035643809";
-    g_daemon.run_mode = data[0] & 1;
-    const std::string control(text_of(data + 1, size - 1));
-    log_dl_msg_handle_cmd(control.c_str(), data, static_cast<std::int32_t>(size));
-    log_stream_stop(log_stream::syslog);
-    log_stream_stop(log_stream::qxdm);
-    check_replies(link);
+    static const tool_end tool;
+    std::string_view input = text_of(data + 1, size - 1);
+    const std::string_view brought = input;
+    g_device = device_traits(data[0]);
+    const std::string_view requests = take_field(input, '\0');
+    set_up(take_field(input, '\0'));
+    g_output = input;
+    std::string uploaded;
+    {
+        const data_links links;
+        uploaded = run_requests(tool, requests, g_device.brings_data ? brought : "");
+    }
+    if (!uploaded.empty())
+        promise(content_of(kPackage) == uploaded, "what was uploaded stands in the package");
+    clean_up(tool);
     return 0;
 }

@@ -2,23 +2,35 @@
 
 #include "platform/vex_platform.h"
 
-#include <cstdarg>
 #include <cstdio>
 #include <cstring>
 
 memory_platform g_platform;
 
-void vex_syslog_append(int level, const char *source, int /*line*/, int module, const char *format, ...)
+namespace
+{
+
+void keep_line(int level, const char *source, int module, const char *format, va_list args)
 {
     char text[8192];
-    va_list args;
-    va_start(args, format);
     std::vsnprintf(text, sizeof text, format, args);
-    va_end(args);
     std::string line = std::to_string(level) + ' ' + source + ' ' + text + (module == 84 ? "|" : "(module!)|");
     if (const std::size_t newline = line.find("\n|"); newline != std::string::npos)
         line[newline] = '$';
     g_platform.log += line;
+}
+
+} // namespace
+
+void vex_syslog_append(int level, const char *source, int /*line*/, int module, const char *format, ...)
+{
+    va_list args;
+    va_start(args, format);
+    if (g_platform.takes_line != nullptr)
+        g_platform.takes_line(source, format, args);
+    else
+        keep_line(level, source, module, format, args);
+    va_end(args);
 }
 
 int vex_nvconfig_read(const char *name, char *value, int max_len)

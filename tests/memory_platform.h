@@ -2,6 +2,7 @@
 #ifndef TESTS_MEMORY_PLATFORM_H
 #define TESTS_MEMORY_PLATFORM_H
 
+#include <cstdarg>
 #include <map>
 #include <string>
 #include <utility>
@@ -13,6 +14,7 @@ struct memory_platform {
     std::vector<std::string> messages;
     int saves = 0;
     bool fails = false;
+    void (*takes_line)(const char *source, const char *format, va_list args) = nullptr; /* in place of `log` */
 
     bool logged(const std::string &text) const { return log.find(text) != std::string::npos; }
     /* What has been logged since the last call. */
