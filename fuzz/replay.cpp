@@ -1,21 +1,116 @@
-/* Runs a fuzz target on the files of the given folders, for builds without a fuzzer. */
+/*
+ * Runs a fuzz target, for builds without a fuzzer: on the files of the given folders, and then for a while on inputs
+ * made of them by chance. The chances are the same in every run. The input that a target ends the process on is shown
+ * in hex, to become a seed: xxd -r -p.
+ */
 #include "fuzz/fuzz.h"
 
+#include <algorithm>
+#include <chrono>
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <memory>
+#include <random>
+#include <vector>
+
+extern "C" void __sanitizer_set_death_callback(void (*callback)()) __attribute__((weak));
+
+namespace
+{
+
+constexpr auto kMutating = std::chrono::seconds(3);
+constexpr std::uint64_t kChances = 20260101;
+constexpr std::size_t kInputMax = 65536;
+
+std::string g_input;
+
+void show_input()
+{
+    for (const char c : g_input)
+        dprintf(STDERR_FILENO, "%02x", static_cast<unsigned char>(c));
+    dprintf(STDERR_FILENO, "\n");
+}
+
+void on_crash(int signal)
+{
+    std::signal(signal, SIG_DFL);
+    show_input();
+    std::raise(signal);
+}
+
+void run()
+{
+    /* A copy of just that size, so that a sanitizer sees what reads beyond it. */
+    const auto bytes = std::make_unique<std::uint8_t[]>(g_input.size());
+    std::copy(g_input.begin(), g_input.end(), bytes.get());
+    LLVMFuzzerTestOneInput(bytes.get(), g_input.size());
+}
+
+std::vector<std::string> read_seeds(int argc, char **argv)
+{
+    std::vector<std::filesystem::path> paths;
+    for (int i = 1; i < argc; ++i)
+        for (const auto &entry : std::filesystem::directory_iterator(argv[i]))
+            paths.push_back(entry.path());
+    std::sort(paths.begin(), paths.end()); /* a folder has no order of its own */
+    std::vector<std::string> seeds;
+    for (const auto &path : paths) {
+        std::ifstream in(path, std::ios::binary);
+        seeds.emplace_back(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+    }
+    return seeds;
+}
+
+/* Makes one change to an input, for which it may use a piece of another one. */
+void change(std::string &input, const std::string &other, std::mt19937_64 &chances)
+{
+    constexpr char kInteresting[] = {0, 1, 0x7f, '\x80', '\xff', '\n', '"', '\\', ';', ',', '~', '#'};
+    const auto below = [&chances](std::size_t end) { return static_cast<std::size_t>(chances() % std::max<std::size_t>(end, 1)); };
+    const std::size_t at = below(input.size() + 1);
+    const std::size_t len = 1 + below(std::size_t{1} << below(9));
+    const std::size_t kind = below(6);
+    if (kind == 0 && at < input.size())
+        input[at] = static_cast<char>(input[at] ^ (1 << below(8)));
+    else if (kind == 1 && at < input.size())
+        input[at] = kInteresting[below(sizeof kInteresting)];
+    else if (kind == 2)
+        input.erase(at, len);
+    else if (kind == 3)
+        input.insert(at, 1, kInteresting[below(sizeof kInteresting)]);
+    else if (kind == 4)
+        input.insert(at, input.substr(at, len));
+    else
+        input.replace(at, below(2) * len, other.substr(below(other.size()), len));
+    input.resize(std::min(input.size(), kInputMax));
+}
+
+} // namespace
 
 int main(int argc, char **argv)
 {
-    int count = 0;
-    for (int i = 1; i < argc; ++i)
-        for (const auto &entry : std::filesystem::directory_iterator(argv[i])) {
-            std::ifstream in(entry.path(), std::ios::binary);
-            const std::string input{std::istreambuf_iterator<char>(in), {}};
-            std::fprintf(stderr, "%s\n", entry.path().c_str());
-            LLVMFuzzerTestOneInput(reinterpret_cast<const std::uint8_t *>(input.data()), input.size());
-            ++count;
-        }
-    std::fprintf(stderr, "%d inputs\n", count);
-    return count > 0 ? 0 : 1; /* without inputs nothing was tried */
+    for (const int signal : {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL})
+        std::signal(signal, on_crash);
+    if (__sanitizer_set_death_callback != nullptr)
+        __sanitizer_set_death_callback(show_input);
+    const std::vector<std::string> seeds = read_seeds(argc, argv);
+    if (seeds.empty())
+        return 1; /* nothing was tried */
+    for (const std::string &seed : seeds) {
+        g_input = seed;
+        run();
+    }
+    std::mt19937_64 chances{kChances};
+    const auto end = std::chrono::steady_clock::now() + kMutating;
+    std::size_t tried = 0;
+    for (; std::chrono::steady_clock::now() < end; ++tried) {
+        g_input = seeds[chances() % seeds.size()];
+        for (auto changes = 1 + chances() % 4; changes > 0; --changes)
+            change(g_input, seeds[chances() % seeds.size()], chances);
+        run();
+    }
+    dprintf(STDERR_FILENO, "%zu seeds and %zu inputs made of them by the chances %llu\n", seeds.size(), tried,
+            static_cast<unsigned long long>(kChances));
+    return 0;
 }
