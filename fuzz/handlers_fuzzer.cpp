@@ -1,16 +1,17 @@
 /*
- * Every handler's control text, on a device whose commands are written down instead of run. No command line fills its
- * buffer, which would mean that it was cut; every request is answered once, by a frame that bears its number and has a
- * control text of at most its bound; what is uploaded and what is fetched is not changed on its way.
+ * Every handler's control text, on a device whose commands are written down instead of run. Every request is
+ * answered once, by a frame that bears its number and has a control text of at most its bound; what is uploaded and
+ * what is fetched is not changed on its way.
  *
- * The first byte of an input says how the device is (see `device`). The rest is up to four control texts, one a line; a
- * NUL, then NV items, NAME=VALUE, one a line; a NUL, then what programs print.
+ * The first byte of an input says how the device is (see device_traits). The rest is up to four control texts, one a
+ * line; a NUL, then NV items, NAME=VALUE, one a line; a NUL, then what programs print.
  */
 #include "core/daemon_state.h"
 #include "core/log_registry.h"
 #include "core/log_streams.h"
 #include "core/log_tools.h"
 #include "fuzz/fuzz.h"
+#include "fuzz/recorded_device.h"
 #include "handlers/handlers.h"
 #include "platform/unique_fd.h"
 #include "protocol/log_json_codec.h"
@@ -18,62 +19,22 @@
 #include "tests/memory_platform.h"
 #include "transport/log_intake.h"
 
-#include <cerrno>
 #include <cstring>
 #include <fstream>
 #include <memory>
-#include <pthread.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
 namespace
 {
 
-constexpr std::size_t kCommandMax = 254; /* one less than the buffers of command lines hold */
 constexpr std::size_t kReplyMax = 1023;
 constexpr std::size_t kVersionReplyMax = 2047;
 constexpr int kRequestsMax = 4;
 constexpr char kPackage[] = "/logfs/logconf.tar";
 constexpr char kArchive[] = "/tmp/MBBlogfs.tar.gz";
 
-/* How the device is. */
-struct device_traits {
-    explicit device_traits(unsigned bits)
-        : client_mode((bits & 1) != 0), tls((bits & 3) == 3), has_config((bits & 4) != 0), has_more((bits & 8) != 0),
-          commands_fail((bits & 16) != 0), linked((bits & 32) != 0), brings_data((bits & 64) != 0),
-          platform_fails((bits & 128) != 0)
-    {
-    }
-    bool client_mode;
-    bool tls;        /* in client mode */
-    bool has_config; /* for the modem log */
-    bool has_more;   /* a second such file, a set-up script, an USB network */
-    bool commands_fail;
-    bool linked;      /* the data links stand */
-    bool brings_data; /* the input itself is every request's data part */
-    bool platform_fails;
-};
-
-device_traits g_device{0};
-std::string g_output; /* of the device's programs */
-int g_link = -1;      /* the device's end of the command connection */
-
-void check_command(std::string_view command)
-{
-    promise(command.size() <= kCommandMax, "a command line has room in its buffer");
-}
-
-/* Command lines that a shell is forked for are seen in the log only. */
-void check_line(const char *source, const char *format, va_list args)
-{
-    char text[8192];
-    std::vsnprintf(text, sizeof text, format, args);
-    constexpr std::string_view kBegin = "cmdStr[";
-    constexpr std::string_view kEnd = "]\n";
-    const std::string_view line = text;
-    if (std::strcmp(source, "log_tools") == 0 && line.starts_with(kBegin))
-        check_command(line.substr(kBegin.size(), line.size() - kBegin.size() - kEnd.size()));
-}
+int g_link = -1; /* the device's end of the command connection */
 
 std::string content_of(const char *path)
 {
@@ -242,47 +203,6 @@ void clean_up(const tool_end &tool)
 }
 
 } // namespace
-
-extern "C" {
-int __wrap_system(const char *command)
-{
-    check_command(command);
-    return g_device.commands_fail ? 1 << 8 : 0;
-}
-FILE *__wrap_popen(const char *command, const char *)
-{
-    check_command(command);
-    return g_output.empty() ? fopen("/dev/null", "r") : fmemopen(g_output.data(), g_output.size(), "r");
-}
-int __wrap_pclose(FILE *stream)
-{
-    return fclose(stream);
-}
-int __wrap_access(const char *path, int)
-{
-    return (std::string_view(path).ends_with("/Diag.cfg") ? g_device.has_config : g_device.has_more) ? 0 : -1;
-}
-int __wrap_fork()
-{
-    return -1;
-}
-unsigned __wrap_sleep(unsigned)
-{
-    return 0;
-}
-void __wrap_sync() {}
-int __wrap_pthread_create(pthread_t *, const pthread_attr_t *, void *(*)(void *), void *)
-{
-    return EAGAIN;
-}
-}
-
-/* A start of a live log gets no threads: one of these two takes the place of what would make them. */
-int refuse_thread(log_thread_task *task, void *argument) __asm__("__wrap__Z17log_thread_createP15log_thread_taskPv");
-int refuse_thread(log_thread_task *, void *)
-{
-    return -1;
-}
 
 int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
 {

@@ -67,7 +67,7 @@ std::vector<std::string> read_seeds(int argc, char **argv)
 void change(std::string &input, const std::string &other, std::mt19937_64 &chances)
 {
     constexpr char kInteresting[] = {0, 1, 0x7f, '\x80', '\xff', '\n', '"', '\\', ';', ',', '~', '#'};
-    const auto below = [&chances](std::size_t end) { return static_cast<std::size_t>(chances() % std::max<std::size_t>(end, 1)); };
+    const auto below = [&chances](std::size_t end) -> std::size_t { return end == 0 ? 0 : chances() % end; };
     const std::size_t at = below(input.size() + 1);
     const std::size_t len = 1 + below(std::size_t{1} << below(9));
     const std::size_t kind = below(6);
