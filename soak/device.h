@@ -24,9 +24,11 @@ public:
 
     /* Whether the daemon runs; that it does not fails the test. */
     bool lives() const;
+    /* Whether memory for what was received was not to be had, so that the next frame cannot be made out. */
+    bool has_dropped_bytes() const { return daemon_->logged("LOG_RECV_PKG_LEN malloc failed.") > 0; }
     /* These fail the test when something is wrong: the daemon is there and answers on both families; it has no more
-     * descriptors and threads than a daemon at rest, and bounded memory; its settings and its log are whole, the latter shown
-     * when something was wrong. */
+     * descriptors and threads than a daemon at rest, and bounded memory; its settings and its log are whole. The log is
+     * shown when anything was wrong. */
     void check_answers();
     void check_bounds();
     void check_nv() const;

@@ -58,18 +58,22 @@ bool soak_peer::listen(int milliseconds)
     return true;
 }
 
-bool soak_peer::answers(int milliseconds)
+daemon_says soak_peer::answer(int milliseconds)
 {
     constexpr char kName[] = "nobody-else-asks-for-me";
     const auto end = tool_clock::now() + std::chrono::milliseconds(milliseconds);
     if (!in_step_ || !say({"8", std::string(R"({"msgid":"8","bsp":{"level":"","module_name":")") + kName + "\"}}", ""}))
-        return false;
+        return daemon_says::goodbye;
     while (said_.find(kName) == std::string::npos) {
+        if (take_frame())
+            continue;
         const auto left = std::chrono::ceil<std::chrono::milliseconds>(end - tool_clock::now()).count();
-        if (!take_frame() && (left <= 0 || !read(static_cast<int>(left), held_)))
-            return false;
+        if (left <= 0)
+            return daemon_says::nothing;
+        if (!read(static_cast<int>(left), held_))
+            return daemon_says::goodbye;
     }
-    return true;
+    return daemon_says::a_reply;
 }
 
 bool soak_peer::take_bytes(int milliseconds)
@@ -103,7 +107,7 @@ bool soak_peer::write(const std::string &bytes)
         if (n > 0)
             sent += static_cast<std::size_t>(n);
         else if (n == 0 || errno != EAGAIN || poll(&entry, 1, kSendPatience) != 1)
-            return false;
+            return in_step_ = false;
     }
     return true;
 }

@@ -9,13 +9,16 @@
 #include <deque>
 #include <string>
 
+/* What a daemon has to say: a reply; nothing; or nothing, as it has hung up or was sent nonsense before. */
+enum class daemon_says { a_reply, nothing, goodbye };
+
 class soak_peer
 {
 public:
     soak_peer(tool_link link, soak_tally &tally);
 
-    /* Sends a command, and remembers that a reply may come, if it has a msgid to tell that by. False when the daemon takes nothing more for now, or is
-     * gone. */
+    /* Sends a command, and remembers that a reply may come, if it has a msgid to tell that by. False when the daemon
+     * takes nothing more for now, or is gone. */
     bool say(const soak_command &command);
     /* Sends any bytes; from then on nobody knows which replies will come, but that they are replies. */
     bool say(const std::string &bytes);
@@ -26,9 +29,8 @@ public:
     bool listen(int milliseconds);
     /* Takes what comes, whatever it is; false when the daemon has hung up. */
     bool take_bytes(int milliseconds);
-    /* Whether the daemon answers one more command within so many milliseconds, after whatever else it still has to say.
-     * When nonsense was sent before, nobody can tell: false. */
-    bool answers(int milliseconds);
+    /* Asks once more, and waits so many milliseconds for the reply behind whatever else the daemon still has to say. */
+    daemon_says answer(int milliseconds);
     /* Ends it without a word, which the daemon learns by a reset. */
     void reset();
 

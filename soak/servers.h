@@ -16,8 +16,8 @@ public:
     bool is_called(tool_clock::time_point end);
     /* Serves it until `end`, or until either has had enough of the other. */
     void serve(tool_clock::time_point end);
-    /* Ends all streams; whether the device is still there and understands, which it must unless it was sent nonsense. */
-    bool calms();
+    /* Ends all streams, and asks once more. */
+    daemon_says calm();
 
 private:
     void take_call();
