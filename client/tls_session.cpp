@@ -38,6 +38,7 @@ struct session_extra {
     std::size_t from = 0;
     std::size_t to = 0;
     bool holding = false;
+    int failure = 0; /* errno of the send that failed; what it left behind is never sent */
 
     std::size_t waiting() const { return to - from; }
     /* Whether what waits may go on waiting for more. */
@@ -72,14 +73,28 @@ bool keep(session_extra &extra, const char *bytes, std::size_t len)
     return true;
 }
 
+/* A writer whose call fails may write the same once more, so its records must not go out after all. Whoever reads or
+ * waits learns of it, too. */
+bool fail(session_extra &extra)
+{
+    extra.failure = errno;
+    shutdown(extra.fd, SHUT_RDWR);
+    errno = extra.failure;
+    return false;
+}
+
 /* Sends what waits, as far as the socket takes it; false, and errno, when the socket has failed. */
 bool pass_on(session_extra &extra)
 {
+    if (extra.failure != 0) {
+        errno = extra.failure;
+        return false;
+    }
     if (extra.waiting() == 0 || extra.held_back())
         return true;
     const ssize_t n = send(extra.fd, extra.held.get() + extra.from, extra.waiting(), MSG_DONTWAIT | MSG_NOSIGNAL);
     if (n < 0)
-        return errno == EAGAIN || errno == EINTR;
+        return errno == EAGAIN || errno == EINTR || fail(extra);
     extra.from += static_cast<std::size_t>(n);
     if (extra.waiting() == 0)
         extra.from = extra.to = 0;

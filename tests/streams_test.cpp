@@ -304,6 +304,15 @@ TEST_F(Streams, MayFailToBegin)
     order(kSyslog, "5004");
     accept_bare(no_tls).reset();
     EXPECT_TRUE(daemon_->logs("vex_open_ssl: SSL connect error "));
+    tool_listener other = listen_at("5002");
+    std::string why;
+    other.context = tool_tls_server("/tmp/c/server.crt", "/tmp/c/server.key", "/tmp/c/ca.crt", why);
+    let_fail({.call = kFaultSend, .only = 5002, .pass = 2}); /* of the handshake */
+    order(kSyslog, "5002");
+    await(other);
+    EXPECT_FALSE(tool_take_call(other, {}, tool_clock::now() + std::chrono::milliseconds(kPatience), why))
+        << "what could not be sent is never sent, least of all twice";
+    EXPECT_EQ(1, failed(kFaultSend));
     EXPECT_TRUE(daemon_->settles(rest));
     hang_up();
 }
