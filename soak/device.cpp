@@ -1,5 +1,7 @@
 #include "soak/device.h"
 
+#include "tests/frame.h"
+
 #include <algorithm>
 #include <fstream>
 #include <sys/wait.h>
@@ -75,6 +77,32 @@ void soak_device::check_answers()
         tool_connection(address).ask(kAskMode);
     for (const char *address : {"127.0.0.1", "::1"})
         EXPECT_EQ(kOnline, tool_connection(address).ask(kAskMode)) << address;
+    const tool_connection tool;
+    for (const char *request :
+         {R"({"msgid":"1","conf_file":{"totalLength":"0"}})", R"({"msgid":"3"})",
+          R"({"msgid":"4","syslogParaSet":{"sysloglevel":"","syslogsize":""}})",
+          R"({"msgid":"5","tcpdump":{"InterfaceName":"lan","Action":"end"}})",
+          R"({"msgid":"6","realtimeLog":{"LogType":"qxdm","Action":"end"}})",
+          R"({"msgid":"8","bsp":{"module_name":"usb","level":""}})", R"({"msgid":"11","mode_lpm_online":"?"})"}) {
+        const std::string reply = tool.ask(request);
+        EXPECT_EQ(std::string(request, 12), reply.substr(0, 12)) << request << reply;
+    }
+    check_archive(tool);
+}
+
+void soak_device::check_archive(const tool_connection &tool)
+{
+    std::string data;
+    tool.send(frame(R"({"msgid":"2"})"));
+    const std::string control = tool.receive(&data);
+    constexpr char kBegin[] = R"({"msgid":"2","GetLocalLog":{"totalLength":")";
+    ASSERT_TRUE(control.starts_with(kBegin)) << control;
+    const std::size_t total = std::stoul(control.substr(sizeof kBegin - 1));
+    for (std::string piece; data.size() < total; data += piece)
+        ASSERT_EQ(control, tool.receive(&piece));
+    EXPECT_EQ(total, data.size());
+    std::ofstream("/tmp/archive", std::ios::binary) << data;
+    EXPECT_EQ("", total == 0 ? "" : run_command("gzip -t /tmp/archive"));
 }
 
 void soak_device::check_bounds()

@@ -26,7 +26,8 @@ public:
     bool lives() const;
     /* Whether memory for what was received was not to be had, so that the next frame cannot be made out. */
     bool has_dropped_bytes() const { return daemon_->logged("LOG_RECV_PKG_LEN malloc failed.") > 0; }
-    /* These fail the test when something is wrong: the daemon is there and answers on both families; it has no more
+    /* These fail the test when something is wrong: the daemon answers on both families, every
+     * command, and with a whole archive; it has no more
      * descriptors and threads than a daemon at rest, and bounded memory; its settings and its log are whole. The log is
      * shown when anything was wrong. */
     void check_answers();
@@ -39,6 +40,8 @@ public:
     long memory_most() const { return memory_most_; }
 
 private:
+    static void check_archive(const tool_connection &tool);
+
     std::optional<daemon_process> daemon_;
     resources rest_;
     std::string settings_; /* lines of NV items that nobody here changes */

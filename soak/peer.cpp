@@ -78,8 +78,11 @@ daemon_says soak_peer::answer(int milliseconds)
 
 bool soak_peer::take_bytes(int milliseconds)
 {
-    std::string gone;
-    return read(milliseconds, gone);
+    std::string taken;
+    const bool there = read(milliseconds, taken);
+    EXPECT_EQ(std::string::npos, taken.find("{\"msgid\":\""))
+        << "a reply came on a data link: " << taken.substr(0, 300);
+    return there;
 }
 
 void soak_peer::reset()
@@ -140,12 +143,12 @@ bool soak_peer::take_frame()
     if (held_.size() < len)
         return false;
     EXPECT_EQ("~#", held_.substr(len - 2, 2));
-    judge(held_.substr(6, control_len));
+    judge(held_.substr(6, control_len), data_len);
     held_.erase(0, len);
     return true;
 }
 
-void soak_peer::judge(const std::string &control)
+void soak_peer::judge(const std::string &control, std::size_t data_len)
 {
     constexpr char kBegin[] = "{\"msgid\":\"";
     constexpr char kEnd[] = "\"}";
@@ -157,6 +160,7 @@ void soak_peer::judge(const std::string &control)
         EXPECT_NE(std::string::npos, control.rfind("\"Result\":\"")) << control;
         msgid = control.substr(sizeof kBegin - 1, control.find('"', sizeof kBegin - 1) - (sizeof kBegin - 1));
     }
+    EXPECT_TRUE(data_len == 0 || msgid == "2") << "only an archive has data: " << control;
     if (!orderly_ || (msgid == "2" && last_ == "2"))
         return;
     while (!asked_.empty() && asked_.front() != msgid)

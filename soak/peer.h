@@ -27,7 +27,7 @@ public:
     /* Takes the replies that come within so many milliseconds, until every command has one. What comes must be whole
      * frames, and answer what was said here, in that order. False when the daemon has hung up. */
     bool listen(int milliseconds);
-    /* Takes what comes, whatever it is; false when the daemon has hung up. */
+    /* Takes a log that comes, anything but replies; false when the daemon has hung up. */
     bool take_bytes(int milliseconds);
     /* Asks once more, and waits so many milliseconds for the reply behind whatever else the daemon still has to say. */
     daemon_says answer(int milliseconds);
@@ -40,7 +40,7 @@ private:
     bool write(const std::string &bytes);
     bool read(int milliseconds, std::string &into);
     bool take_frame();
-    void judge(const std::string &control);
+    void judge(const std::string &control, std::size_t data_len);
 
     soak_tally *tally_;
     std::deque<std::string> asked_; /* the msgids of what is not answered yet */

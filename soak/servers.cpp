@@ -45,8 +45,6 @@ void random_server::serve(tool_clock::time_point end)
 daemon_says random_server::calm()
 {
     links_.clear();
-    while (unique_fd{accept4(listener_.fd.get(), nullptr, nullptr, SOCK_CLOEXEC)}) { /* who still calls is hung up on */
-    }
     const bool said = control_->say(end_of("syslog")) && control_->say(end_of("qxdm"));
     return said ? control_->answer(kPatience) : daemon_says::goodbye;
 }

@@ -16,7 +16,7 @@ public:
     bool is_called(tool_clock::time_point end);
     /* Serves it until `end`, or until either has had enough of the other. */
     void serve(tool_clock::time_point end);
-    /* Ends all streams, and asks once more. */
+    /* Hangs up on all streams and ends them, and asks once more. */
     daemon_says calm();
 
 private:
