@@ -6,7 +6,6 @@
 #include "protocol/log_pkg_codec.h"
 #include "tests/memory_platform.h"
 
-#include <algorithm>
 #include <memory>
 #include <vector>
 

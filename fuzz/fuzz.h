@@ -34,4 +34,19 @@ inline std::string_view take_field(std::string_view &input, char end)
     return field;
 }
 
+/* Whether a terminal would obey something in a text: a control character, but for those that may stand there, or one of
+ * the second half of them, in UTF-8. */
+inline bool commands_terminal(std::string_view text, std::string_view allowed = "")
+{
+    unsigned char last = 0;
+    for (const char c : text) {
+        const auto byte = static_cast<unsigned char>(c);
+        if (((byte < 0x20 || byte == 0x7f) && allowed.find(c) == allowed.npos) ||
+            (last == 0xc2 && byte >= 0x80 && byte < 0xa0))
+            return true;
+        last = byte;
+    }
+    return false;
+}
+
 #endif

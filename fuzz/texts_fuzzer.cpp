@@ -7,7 +7,6 @@
 #include <climits>
 #include <cstring>
 #include <optional>
-#include <vector>
 
 namespace
 {

@@ -6,7 +6,6 @@
 #include "tools/tool_answer.h"
 #include "tools/tool_listener.h"
 
-#include <algorithm>
 #include <cstring>
 #include <sys/un.h>
 
@@ -27,12 +26,6 @@ struct place {
     sockaddr_un address{};
     tool_listener listener;
 };
-
-bool shows_controls(const std::string &text)
-{
-    return std::any_of(text.begin(), text.end(),
-                       [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; });
-}
 
 } // namespace
 
@@ -56,7 +49,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
     for (const char *const group : {"ControlLink", "DataLink"})
         for (const char *const name : {"projectName", "VersionInfo", "imei", "modem_msn", "ConnectType"}) {
             const std::string text = tool_announced(*call, group, name);
-            promise(!shows_controls(text), "a caller's words cannot command a terminal");
+            promise(!commands_terminal(text), "a caller's words cannot command a terminal");
             const cJSON *const member = cJSON_GetObjectItem(cJSON_GetObjectItem(call->announcement.get(), group), name);
             promise(text.empty() == (!cJSON_IsString(member) || *member->valuestring == '\0'), "they are shown");
         }

@@ -6,16 +6,8 @@
 #include "tools/tool_answer.h"
 #include "tools/tool_link.h"
 
-#include <algorithm>
-
 namespace
 {
-
-bool shows_controls(const std::string &text)
-{
-    return std::any_of(text.begin(), text.end(),
-                       [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == 0x7f; });
-}
 
 std::string bytes_of(const tool_frame &frame)
 {
@@ -33,11 +25,11 @@ void check_answer(const std::string &control)
     const tool_answer answer = tool_read_answer(control, tool_msgid(control));
     promise((answer.verdict == tool_verdict::refused) == control.empty(), "an empty answer is a refusal");
     promise((answer.verdict == tool_verdict::success) == answer.reason.empty(), "a reason for what is no success");
-    promise(!shows_controls(answer.reason), "which cannot command a terminal");
-    promise(!shows_controls(tool_answer_text(answer, nullptr, "Result")), "and no more can a value");
+    promise(!commands_terminal(answer.reason), "which cannot command a terminal");
+    promise(!commands_terminal(tool_answer_text(answer, nullptr, "Result")), "and no more can a value");
     promise((answer.verdict == tool_verdict::success) == (tool_answer_text(answer, nullptr, "Result") == "Success"),
             "only Success is success");
-    promise(!shows_controls(tool_answer_text(answer, "bsp", "level")), "nor one in a group");
+    promise(!commands_terminal(tool_answer_text(answer, "bsp", "level")), "nor one in a group");
     if (answer.verdict != tool_verdict::success)
         return;
     const auto verdict = tool_read_answer(control, tool_msgid(control) + '0').verdict;
@@ -64,7 +56,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
         sent.remove_prefix(bytes.size());
         check_answer(frame->control);
     }
-    promise(!why.empty() && !shows_controls(why), "a reason for the end");
+    promise(!why.empty() && !commands_terminal(why), "a reason for the end");
     const auto msg = std::make_unique<log_msg>();
     for (std::size_t at = 0; (at = sent.find(PKG_TAIL, at)) != sent.npos && at < kPkgMax;) {
         at += kPkgTagLen;

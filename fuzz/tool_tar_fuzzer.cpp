@@ -31,12 +31,6 @@ std::string pack(std::string_view bytes)
     return packed;
 }
 
-bool is_shown(const std::string &text)
-{
-    return std::none_of(text.begin(), text.end(),
-                        [](char c) { return (static_cast<unsigned char>(c) < 0x20 && c != '\n') || c == 0x7f; });
-}
-
 /* Whether the tar is taken. */
 bool check(std::string_view file, tool_packing packing)
 {
@@ -48,7 +42,7 @@ bool check(std::string_view file, tool_packing packing)
     const bool taken = tool_check_tar(fd.get(), packing, contents, why);
     promise(taken || !why.empty(), "a reason for what is refused");
     promise(!taken || contents.substr(0, contents.find('\n')).find(" file") != std::string::npos, "files are counted");
-    promise(is_shown(contents), "names cannot command a terminal");
+    promise(!commands_terminal(contents, "\n"), "names cannot command a terminal");
     promise(std::count(contents.begin(), contents.end(), '\n') <= 1 + std::ptrdiff_t(file.size() * 1100 / 512 + 2),
             "a line at most for each file");
     return taken;
