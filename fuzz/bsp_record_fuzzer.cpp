@@ -1,7 +1,7 @@
 /*
- * The record of kernel-module levels, whatever it held before: a level that was stored is found, the other modules keep
- * theirs, and nothing in the record commands the shell when the levels are restored. An input is the name of a module
- * and its level, with a ';' behind each, and the record.
+ * The record of kernel-module levels, whatever it held before: a level that has room is stored and found, the other
+ * modules keep theirs, and nothing in the record commands the shell when the levels are restored. An input is the name
+ * of a module and its level, with a ';' behind each, and the record.
  */
 #include "fuzz/fuzz.h"
 #include "handlers/bsp_module_level.h"
@@ -32,18 +32,24 @@ void check_store(const std::string &name, const std::string &level, std::string_
     std::string others[kRestored];
     std::string levels[kRestored];
     bool comparable = true; /* a name that is too long may be taken for the one that it begins with */
+    std::size_t most = name.size() + level.size() + 2; /* bytes that the new record takes */
     std::size_t count = 0;
     for (; !record.empty() && count < kRestored; ++count) {
         const std::string_view piece = take_field(record, ';');
         others[count] = piece.substr(0, piece.find(','));
+        most += piece.size() + 1 + (others[count] == name ? level.size() : 0);
         comparable = comparable && others[count].size() < kBspFieldSize;
         if (!log_bsp_text_allowed(others[count].c_str()) || piece.size() >= 64 || piece.find(',') == piece.npos)
             others[count] = name; /* not one that has to be kept */
         levels[count] = level_of(others[count]);
     }
-    if (log_set_bsp_module_level(name.c_str(), level.c_str()) != 0)
-        return;
+    const std::string before = g_platform.items[kItem];
     const std::string &stored = g_platform.items[kItem];
+    if (log_set_bsp_module_level(name.c_str(), level.c_str()) != 0) {
+        promise(most >= kBspRecordSize, "what has room is stored");
+        promise(stored == before, "what has no room changes nothing");
+        return;
+    }
     promise(stored.size() < kBspRecordSize, "a record has room in its field");
     promise(stored.find(name + ',' + level + ';') != std::string::npos, "what was stored stands in the record");
     promise(count == kRestored || !comparable || level_of(name) == level, "what was stored is found");

@@ -1,7 +1,8 @@
 /*
  * Every handler's control text, on a device whose commands are written down instead of run. Every request is
  * answered once, by a frame that bears its number and has a control text of at most its bound; what is uploaded and
- * what is fetched is not changed on its way.
+ * what is fetched arrives, and is not changed on its way. The memory for JSON is the daemon's, and gives out no byte
+ * twice.
  *
  * The first byte of an input says how the device is (see device_traits). The rest is up to four control texts, one a
  * line; a NUL, then NV items, NAME=VALUE, one a line; a NUL, then what programs print.
@@ -14,6 +15,7 @@
 #include "fuzz/recorded_device.h"
 #include "handlers/handlers.h"
 #include "platform/unique_fd.h"
+#include "protocol/json_memory.h"
 #include "protocol/log_json_codec.h"
 #include "protocol/log_pkg_codec.h"
 #include "tests/memory_platform.h"
@@ -24,6 +26,8 @@
 #include <memory>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <utility>
+#include <vector>
 
 namespace
 {
@@ -61,6 +65,7 @@ struct tool_end {
     tool_end()
     {
         int ends[2] = {-1, -1};
+        json_memory_install();
         promise(socketpair(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK, 0, ends) == 0, "a socket pair");
         fd.reset(ends[1]);
         g_link = ends[0];
@@ -93,6 +98,11 @@ reply take_reply(std::string_view &bytes)
     return {{msg->control, control_len}, std::string(text_of(msg->data, static_cast<std::size_t>(msg->dataLen)))};
 }
 
+bool succeeded(const std::string &control)
+{
+    return control.ends_with("\"Result\":\"Success\"}");
+}
+
 /* Takes the replies to a request of that number off the connection; the control text of the last one. */
 std::string check_replies(const tool_end &tool, int msgid)
 {
@@ -112,7 +122,8 @@ std::string check_replies(const tool_end &tool, int msgid)
     }
     const bool answers = msgid >= 1 && msgid <= 11 && msgid != 9 && msgid != 10;
     promise(count == (answers ? 1 : 0) || (msgid == 2 && count > 1), "a request is answered once");
-    promise(data.empty() || data == tool.archive, "the archive arrives as it is");
+    const bool packed = msgid == 2 && succeeded(last.control);
+    promise(data == (packed ? tool.archive : ""), "the archive arrives as it is, and only when it is asked for");
     return last.control;
 }
 
@@ -184,11 +195,26 @@ std::string run_requests(const tool_end &tool, std::string_view requests, std::s
         const int msgid = log_json_get_msgid(control.c_str(), tree);
         log_dl_msg_handle_cmd(control.c_str(), reinterpret_cast<const unsigned char *>(data.data()),
                               static_cast<std::int32_t>(data.size()));
-        const bool done = check_replies(tool, msgid).ends_with("\"Result\":\"Success\"}");
+        const bool done = succeeded(check_replies(tool, msgid));
         if (msgid == 1 && done)
             uploaded += data;
     }
     return uploaded;
+}
+
+/* Pieces of the memory that trees are made of, of such sizes: each is nobody else's until it is given back. */
+void check_pieces(std::string_view sizes)
+{
+    std::vector<std::pair<std::string, void *>> pieces;
+    for (const char c : sizes.substr(0, 64)) {
+        const std::string content(static_cast<unsigned char>(c), static_cast<char>(pieces.size()));
+        pieces.emplace_back(content,
+                            std::memcpy(cJSON_malloc(content.size() + 1), content.c_str(), content.size() + 1));
+    }
+    for (const auto &[content, piece] : pieces)
+        promise(std::memcmp(piece, content.c_str(), content.size() + 1) == 0, "a piece of a tree is its own");
+    for (const auto &[content, piece] : pieces)
+        cJSON_free(piece);
 }
 
 /* What is left of one input is not for the next one. */
@@ -213,6 +239,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
     const std::string_view brought = input;
     g_device = device_traits(data[0]);
     const std::string_view requests = take_field(input, '\0');
+    check_pieces(requests);
     set_up(take_field(input, '\0'));
     g_output = input;
     std::string uploaded;

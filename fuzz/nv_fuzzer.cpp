@@ -1,5 +1,5 @@
 /*
- * The NV file, whatever it holds: what is set is read back, no other item changes, and a reader is given as much of a
+ * The NV file, whatever it holds: what is set is read back, no other line changes, and a reader is given as much of a
  * value as its buffer holds. An input is a value, its end a NUL, and the file.
  */
 #include "fuzz/fuzz.h"
@@ -37,6 +37,18 @@ void check_read(const char *name, const std::optional<std::string> &value)
     promise(buffer[kRoom] == '?', "and no more");
 }
 
+/* The lines of a file that are not the item which is set. The last one may lack its end. */
+std::string other_lines(std::string_view file)
+{
+    std::string lines;
+    while (!file.empty()) {
+        const std::string_view line = take_field(file, '\n');
+        if (!line.starts_with("model_name="))
+            lines.append(line) += '\n';
+    }
+    return lines;
+}
+
 /* The same through the file itself. */
 void check_file(std::string_view file, const std::string &value)
 {
@@ -64,6 +76,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
     const std::string item = nv_text_set("", "model_name", value);
     promise(item.find_first_of("\n\r") == item.size() - 1, "an item is one line");
     promise(nv_text_get(changed, "imei") == other, "other items stay as they are");
+    promise(other_lines(changed) == other_lines(file), "every other line is left as it was");
     promise(nv_text_set(changed, "model_name", value) == changed, "the same again changes nothing");
     check_file(file, value);
     return 0;
