@@ -1,7 +1,7 @@
 /*
  * Runs a fuzz target, for builds without a fuzzer: on the files of the given folders, and then for a while on inputs
- * made of them by chance. The chances are the same in every run. The input that a target ends the process on is shown
- * in hex, to become a seed: xxd -r -p.
+ * made of them by chance. The chances are the same in every run. The input that a target ends the process on, or hangs
+ * on, is shown in hex, to become a seed: xxd -r -p. Nor may inputs leave descriptors open.
  */
 #include "fuzz/fuzz.h"
 
@@ -23,6 +23,7 @@ namespace
 constexpr auto kMutating = std::chrono::seconds(3);
 constexpr std::uint64_t kChances = 20260101;
 constexpr std::size_t kInputMax = 65536;
+constexpr unsigned kSeconds = 20; /* for one input; after that, the target hangs */
 
 std::string g_input;
 
@@ -33,19 +34,39 @@ void show_input()
     dprintf(STDERR_FILENO, "\n");
 }
 
-void on_crash(int signal)
+void on_signal(int signal)
 {
     std::signal(signal, SIG_DFL);
+    if (signal == SIGALRM)
+        dprintf(STDERR_FILENO, "no end after %u seconds\n", kSeconds);
     show_input();
     std::raise(signal);
 }
 
 void run()
 {
+    alarm(kSeconds);
     /* A copy of just that size, so that a sanitizer sees what reads beyond it. */
     const auto bytes = std::make_unique<std::uint8_t[]>(g_input.size());
     std::copy(g_input.begin(), g_input.end(), bytes.get());
     LLVMFuzzerTestOneInput(bytes.get(), g_input.size());
+}
+
+/* A sanitizer is left the signals that it tells more of, and shows the input after that. */
+void handle_ends()
+{
+    for (const int signal : {SIGABRT, SIGALRM})
+        std::signal(signal, on_signal);
+    if (__sanitizer_set_death_callback != nullptr)
+        __sanitizer_set_death_callback(show_input);
+    else
+        for (const int signal : {SIGSEGV, SIGBUS, SIGFPE, SIGILL})
+            std::signal(signal, on_signal);
+}
+
+std::ptrdiff_t count_descriptors()
+{
+    return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {});
 }
 
 std::vector<std::string> read_seeds(int argc, char **argv)
@@ -90,10 +111,7 @@ void change(std::string &input, const std::string &other, std::mt19937_64 &chanc
 
 int main(int argc, char **argv)
 {
-    for (const int signal : {SIGABRT, SIGSEGV, SIGBUS, SIGFPE, SIGILL})
-        std::signal(signal, on_crash);
-    if (__sanitizer_set_death_callback != nullptr)
-        __sanitizer_set_death_callback(show_input);
+    handle_ends();
     const std::vector<std::string> seeds = read_seeds(argc, argv);
     if (seeds.empty())
         return 1; /* nothing was tried */
@@ -101,6 +119,7 @@ int main(int argc, char **argv)
         g_input = seed;
         run();
     }
+    const std::ptrdiff_t kept = count_descriptors(); /* a target may keep some from its first input on */
     std::mt19937_64 chances{kChances};
     const auto end = std::chrono::steady_clock::now() + kMutating;
     std::size_t tried = 0;
@@ -112,5 +131,8 @@ int main(int argc, char **argv)
     }
     dprintf(STDERR_FILENO, "%zu seeds and %zu inputs made of them by the chances %llu\n", seeds.size(), tried,
             static_cast<unsigned long long>(kChances));
-    return 0;
+    const std::ptrdiff_t left_open = count_descriptors() - kept;
+    if (left_open != 0)
+        dprintf(STDERR_FILENO, "the inputs left %td more descriptors open\n", left_open);
+    return left_open == 0 ? 0 : 1;
 }
