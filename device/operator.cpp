@@ -1,6 +1,7 @@
 #include "device/operator.h"
 
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -30,13 +31,13 @@ std::string read_file(const std::string &path)
 
 void set_nv(const std::string &name, const std::string &value)
 {
-    run_command("sed -i '/^" + name + "=/d' /etc/vex/nvconfig");
+    run_command("sed -i '/^" + name + "=/d' " + kNvFile);
     std::ofstream(kNvFile, std::ios::app) << name << '=' << value << '\n';
 }
 
 std::string get_nv(const std::string &name)
 {
-    return run_command("sed -n 's/^" + name + "=//p' /etc/vex/nvconfig | tr -d '\\n'");
+    return run_command("sed -n 's/^" + name + "=//p' " + kNvFile + " | tr -d '\\n'");
 }
 
 void forget_nv()
@@ -46,8 +47,14 @@ void forget_nv()
 
 void install_program(const std::string &name, const std::string &script)
 {
-    std::ofstream("/usr/vex/override/" + name) << "#!/bin/sh\n" << script;
-    chmod(("/usr/vex/override/" + name).c_str(), 0755);
+    const std::string path = "/usr/vex/override/" + name;
+    std::ofstream file(path);
+    file << "#!/bin/sh\n" << script;
+    file.close();
+    if (!file || chmod(path.c_str(), 0755) != 0) {
+        std::perror(path.c_str());
+        std::abort();
+    }
 }
 
 std::string run_command(const std::string &command, int *status)

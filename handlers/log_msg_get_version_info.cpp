@@ -87,10 +87,11 @@ int log_msg_get_version_info(const char *control, const unsigned char *data, std
         return -1;
     }
     cJSON *const members = info.get();
-    if (add_text(root.get(), "msgid", "3") && add(root.get(), "VersionInfo", std::move(info)) &&
-        fill_version_info(members) && add_text(root.get(), "Result", kSuccess))
-        reply_tree(root.get());
-    else
+    if (!add_text(root.get(), "msgid", "3") || !add(root.get(), "VersionInfo", std::move(info)) ||
+        !fill_version_info(members) || !add_text(root.get(), "Result", kSuccess)) {
         LOG_NOTE("%s: no memory for the reply\n", __func__);
+        return -1;
+    }
+    reply_tree(root.get());
     return 0;
 }

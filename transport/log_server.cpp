@@ -118,7 +118,7 @@ template <typename Address> unique_fd accept_next(const char *name, int listener
     socklen_t len = sizeof *peer;
     unique_fd client{accept4(listener, reinterpret_cast<sockaddr *>(peer), &len, SOCK_CLOEXEC)};
     if (log_cmd_fd() != -1)
-        sched_yield(); /* a tool that has just closed its connection need not be thrown out: its thread is about to end */
+        sched_yield(); /* a tool that has just closed its connection need not be thrown out: its thread ends soon */
     if (!client) {
         LOG_NOTE("%s accept error %s(errno: %d) ", name, std::strerror(errno), errno);
         sleep(kAcceptPause);
