@@ -128,6 +128,22 @@ TEST_F(Faults, OfCommandsAndRepliesChangeNothingElse)
     EXPECT_EQ(2, daemon_->logged("log_send_pkg_msg: send pkg fail"));
 }
 
+/* First of the new file, then of its folder. */
+TEST_F(Faults, OfASyncLeaveTheItemToTheNextCommit)
+{
+    start();
+    const tool_connection tool;
+    for (const int pass : {0, 1}) {
+        forget_nv();
+        let_fail({.call = kFaultFsync, .pass = pass});
+        tool.ask(R"({"msgid":"8","bsp":{"module_name":"usb","level":"err"}})");
+        EXPECT_EQ(1, failed(kFaultFsync));
+        EXPECT_EQ(pass == 0 ? "" : "usb,err;", get_nv("bsplog_module_level"));
+        tool.ask(R"({"msgid":"8","bsp":{"module_name":"wlan","level":"err"}})");
+        EXPECT_EQ("usb,err;wlan,err;", get_nv("bsplog_module_level"));
+    }
+}
+
 TEST_F(Faults, LoseAnArchiveAndNothingElse)
 {
     install_program("tar", "echo logs >$2; echo packs >/tmp/packs; read go </tmp/go");

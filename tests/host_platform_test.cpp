@@ -3,6 +3,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <gtest/gtest.h>
@@ -48,22 +49,30 @@ protected:
     std::string nv_;
 };
 
-TEST_F(HostPlatform, NvWriteThatFindsNoRoomIsCommittedLater)
+TEST_F(HostPlatform, NvCommitKeepsWhatItDoesNotChangeAndWaitsForRoom)
 {
-    set("item", "old");
+    const std::string old = "# a comment\nimei=1\n\nimei2=2\nbroken line\nimei=3\nlast=no newline";
+    std::ofstream(nv_) << old;
+    for (const char *name : {"", "a=b", "#a", "a\nb"})
+        EXPECT_EQ(0, vex_nvconfig_write(name, "x", 1)) << name;
+    EXPECT_EQ(1, vex_nvconfig_write("cut", "ab\0cd", 5) * vex_nvconfig_write("imei", "356 and more", 3));
     signal(SIGXFSZ, SIG_IGN);
     rlimit limit{};
     getrlimit(RLIMIT_FSIZE, &limit);
     const rlimit full{4, limit.rlim_max};
     setrlimit(RLIMIT_FSIZE, &full);
-    ASSERT_EQ(1, vex_nvconfig_write("item", "new", 3));
     EXPECT_EQ(-1, cfg_save());
     setrlimit(RLIMIT_FSIZE, &limit);
-    EXPECT_EQ("item=old\n", read_file(nv_));
-    EXPECT_EQ("new", get("item"));
+    EXPECT_EQ(old, read_file(nv_));
+    EXPECT_EQ("ab", get("cut"));
     EXPECT_EQ(0, cfg_save());
-    EXPECT_EQ("item=new\n", read_file(nv_));
+    EXPECT_EQ("# a comment\nimei=356\n\nimei2=2\nbroken line\nlast=no newline\ncut=ab\n", read_file(nv_));
     EXPECT_FALSE(std::filesystem::exists(nv_ + ".new"));
+    char few[] = "xxxx";
+    EXPECT_EQ(0, vex_nvconfig_read("missing", few, 3));
+    EXPECT_STREQ("xxxx", few);
+    EXPECT_EQ(1, vex_nvconfig_read("imei", few, 2));
+    EXPECT_STREQ("35xx", few);
 }
 
 TEST_F(HostPlatform, NvWritersLoseNothingToEachOther)
@@ -113,8 +122,10 @@ TEST_F(HostPlatform, NvItemsAreOldOrNewWhenKilled)
             }
         }
         const int last = first + static_cast<int>(random() % 30);
-        while (shared->begun < last)
+        while (shared->begun < last) {
+            ASSERT_EQ(0, waitpid(child, nullptr, WNOHANG)) << "it has ended by itself";
             sched_yield();
+        }
         usleep(static_cast<useconds_t>(random() % 1000)); /* into the middle of a write, wherever that is */
         kill(child, SIGKILL);
         waitpid(child, nullptr, 0);
@@ -134,16 +145,20 @@ TEST_F(HostPlatform, LogLinesAreLinesWhateverTheyHold)
     errno = EXDEV;
     vex_syslog_append(0, "vex_log_manage", 7, 84, "%s|%d\n\n", "a\x1b[0m\r\n\x7f\\b\xc3\xa4", -5);
     vex_syslog_append(7, "log_tools", 1, 84, "above the level");
-    vex_syslog_append(6, "log_tools", 3, 84, "%s", std::string(9000, 'x').c_str());
+    vex_syslog_append(6, "log_tools", 3, 84, "%s", std::string(9000, '\n').c_str());
     EXPECT_EQ(EXDEV, errno);
     std::istringstream lines(read_file(dir_ + "/log"));
+    std::string line, longest("Z 6 log_tools:3 ");
+    for (int i = 0; i < 4094; ++i)
+        longest += "\\x0a";
     for (const std::string &expected :
-         {std::string("0 vex_log_manage:7 a\\x1b[0m\\x0d\\x0a\\x7f\\x5cb\xc3\xa4|-5\\x0a"),
-          std::string(4095, 'x').insert(0, "6 log_tools:3 "), std::string()}) {
-        std::string line;
-        std::getline(lines, line);
-        EXPECT_EQ(expected, line.substr(std::min<std::size_t>(line.size(), 28))); /* behind the time */
+         {std::string("Z 0 vex_log_manage:7 a\\x1b[0m\\x0d\\x0a\\x7f\\x5cb\xc3\xa4|-5\\x0a"), longest}) {
+        tm utc{};
+        ASSERT_TRUE(std::getline(lines, line) && strptime(line.c_str(), "%Y-%m-%dT%H:%M:%S.", &utc) != nullptr);
+        EXPECT_GE(60, std::abs(std::time(nullptr) - timegm(&utc)));
+        EXPECT_EQ(expected, line.substr(26)); /* behind the microseconds */
     }
+    EXPECT_FALSE(std::getline(lines, line));
 }
 
 } // namespace

@@ -109,16 +109,18 @@ TEST_F(Requests, ToConfirmALinkAreTheDevicesOwnServersOnly)
     g_platform.items["imei"] = "356938035643809";
     for (const auto &[members, words] : {
              std::pair{R"("x":{)", "cannot find K_DataLink item"},
-             {R"("datalink":{"imei":"356938035643808","ConnectType":"qxdm_connect")",
+             {R"("datalink":{"imei":"356938035643808","ConnectType":"modemlog_connect")",
               "imei = [356938035643808] is incorrect"},
-             {R"("datalink":{"ConnectType":"syslog_connect")", "cannot find K_Imei item"},
+             {R"("datalink":{"ConnectType":"modemlog_connect")", "cannot find K_Imei item"},
              {R"("datalink":{"IMEI":"356938035643809")", "cannot find K_ConnectType item"},
-             {R"("datalink":{"imei":"356938035643809","ConnectType":"SYSLOG_CONNECT")",
-              "unknow ConnectType = [SYSLOG_CONNECT]"},
+             {R"("datalink":{"imei":"356938035643809","ConnectType":"MODEMLOG_CONNECT")",
+              "unknow ConnectType = [MODEMLOG_CONNECT]"},
+             {R"("datalink":{"IMEI":"356938035643809","connecttype":"modemlog_connect")",
+              "cmdStr[killall -9 diag_mdlog]"},
          }) {
         EXPECT_EQ("", ask(10, std::string(members) + "}"));
         EXPECT_TRUE(g_platform.logged(words)) << g_platform.log;
-        EXPECT_FALSE(g_platform.logged("cmdStr["));
+        EXPECT_EQ(*words == 'c' && words[1] == 'm', g_platform.logged("cmdStr["));
     }
 }
 
