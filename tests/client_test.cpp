@@ -135,7 +135,8 @@ TEST_F(Client, AnswersWhatItIsAskedDuringATransfer)
 
 TEST_F(Client, EndsWithItsServerWheneverThatIs)
 {
-    const std::string refuses = "sleep 9 | timeout 1 openssl s_server -accept 5000 -cert /tmp/c/server.crt -key "
+    const std::string refuses = "until grep -qE 'SSL connect error|recvfrom error' /tmp/daemon.log; do sleep 0.01; "
+                                "done | openssl s_server -naccept 1 -accept 5000 -cert /tmp/c/server.crt -key "
                                 "/tmp/c/server.key -Verify 1 -verify_return_error -CAfile /tmp/c/server.crt ";
     run_command("mkdir /tmp/f && mount -t tmpfs -o size=100k none /tmp/f"); /* full before an archive has come */
     for (const auto &[server, tls_off, words] :
@@ -148,11 +149,13 @@ TEST_F(Client, EndsWithItsServerWheneverThatIs)
           {"head -c 9000000 /dev/zero >/logfs/zero; printf 'archive /tmp/f/x\n' | vex_log_tool serve --listen 5000" +
                kTls,
            "0", "recvcount=0,client close"},
-          {std::string("printf '#~\\0\\0\\0\\036{\"msgid' | timeout 1 busybox nc -l -p 5000"), "1",
-           "recv data len =13"},
+          {std::string("{ printf '#~\\0\\0\\0\\036{\"msgid'; until grep -q 'recv data len =13' /tmp/daemon.log; do "
+                       "sleep 0.01; done; } | busybox nc -l -p 5000"),
+           "1", "recv data len =13"},
           {std::string("printf 'archive /dev/full/x\\n' | vex_log_tool serve --listen 5000 --plain"), "1",
            "recvcount=0,client close"}}) {
         set_nv("log_use_ssl_disable", tls_off);
+        run_command("rm -f /tmp/daemon.log");
         start_server(server);
         daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
         EXPECT_EQ(0, daemon.wait_exit()) << server;

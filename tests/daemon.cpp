@@ -13,7 +13,6 @@
 #include <poll.h>
 #include <sstream>
 #include <sys/inotify.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <thread>
 
@@ -61,9 +60,10 @@ tool_connection::tool_connection(const char *address)
     fd.reset(socket(to->ai_family, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const timeval patience{kPatience / 1000, 0};
     setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
     int result = -1;
     /* The daemon's last word before it listens is a log line, a moment ahead of the call. */
-    for (int i = 0; i < 100000 && (result = connect(fd.get(), to->ai_addr, to->ai_addrlen)) != 0; ++i)
+    while ((result = connect(fd.get(), to->ai_addr, to->ai_addrlen)) != 0 && std::chrono::steady_clock::now() < end)
         std::this_thread::yield();
     EXPECT_EQ(0, result) << std::strerror(errno);
     freeaddrinfo(to);
