@@ -3,12 +3,10 @@
 #include "tests/frame.h"
 
 #include <arpa/inet.h>
-#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <netinet/in.h>
 #include <sys/socket.h>
-#include <thread>
 #include <tuple>
 
 namespace

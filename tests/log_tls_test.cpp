@@ -10,6 +10,7 @@
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <thread>
+#include <tuple>
 
 /* The call of the library that always returns 0. */
 static const char *g_failing = "";
@@ -51,20 +52,16 @@ TEST(TlsSession, IsOpenedByACertificateThatIsThereAndVerifies)
 {
     std::signal(SIGPIPE, SIG_IGN); /* a server's last word may come too late */
     ASSERT_EQ(0, std::system(SOURCE_DIR "/device/certificates /tmp/c"));
-    const struct {
-        const char *call;
-        log_tls_result result;
-        const char *words;
-    } starts[] = {
-        {"SSL_CTX_new", log_tls_result::no_context, "**SOCKET: Create SSL_CTX error...$"},
-        {"SSL_CTX_set_default_verify_paths", log_tls_result::bad_files, "Call to SSL_CTX_set_default_verify_paths"},
-        {"SSL_CTX_check_private_key", log_tls_result::bad_files, "SSL_CTX_check_private_key failed"},
-        {"", log_tls_result::ready, ""},
-    };
-    for (const auto &s : starts) {
-        g_failing = s.call;
-        EXPECT_EQ(s.result, log_tls_start()) << s.call;
-        EXPECT_TRUE(g_platform.logged(s.words)) << s.call;
+    for (const auto &[call, result, words] : {
+             std::tuple{"SSL_CTX_new", log_tls_result::no_context, "**SOCKET: Create SSL_CTX error...$"},
+             {"SSL_CTX_set_default_verify_paths", log_tls_result::bad_files,
+              "Call to SSL_CTX_set_default_verify_paths"},
+             {"SSL_CTX_check_private_key", log_tls_result::bad_files, "SSL_CTX_check_private_key failed"},
+             {"", log_tls_result::ready, ""},
+         }) {
+        g_failing = call;
+        EXPECT_EQ(result, log_tls_start()) << call;
+        EXPECT_TRUE(g_platform.logged(words)) << call;
     }
     SSL *session = nullptr;
     ASSERT_EQ(1, open_session(&session));

@@ -2,11 +2,9 @@
 #include "tests/frame.h"
 
 #include <functional>
-#include <gtest/gtest.h>
 #include <netinet/in.h>
 #include <sys/socket.h>
 #include <thread>
-#include <vector>
 
 namespace
 {

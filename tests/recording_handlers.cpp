@@ -2,6 +2,8 @@
 
 #include "protocol/log_json_codec.h"
 
+#include <utility>
+
 std::string g_commands;
 
 namespace
@@ -14,16 +16,11 @@ template <int msgid> int record(const char *control, const unsigned char *data, 
     return 0;
 }
 
+template <int... n> std::array<log_msg_handler_entry, 11> all(std::integer_sequence<int, n...> /*rows*/)
+{
+    return {{{n + 1, n == 8 ? nullptr : record<n + 1>}...}};
+}
+
 } // namespace
 
-const std::array<log_msg_handler_entry, 11> log_msg_handler_table{{{1, record<1>},
-                                                                   {2, record<2>},
-                                                                   {3, record<3>},
-                                                                   {4, record<4>},
-                                                                   {5, record<5>},
-                                                                   {6, record<6>},
-                                                                   {7, record<7>},
-                                                                   {8, record<8>},
-                                                                   {9, nullptr},
-                                                                   {10, record<10>},
-                                                                   {11, record<11>}}};
+const std::array<log_msg_handler_entry, 11> log_msg_handler_table = all(std::make_integer_sequence<int, 11>());

@@ -120,9 +120,9 @@ protected:
     }
     void end(const stream &which)
     {
-        EXPECT_EQ(
-            R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":"0","ip":""},"Result":"Success"})",
-            ask(which, "end"));
+        EXPECT_EQ(R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"tcp","port":"0","ip":""},)"
+                  R"("Result":"Success"})",
+                  ask(which, "end"));
     }
     /* Over TLS, has both ends change their keys. */
     static void change_keys(const tool_link &link)
