@@ -9,11 +9,7 @@ namespace
 {
 
 const std::string kThree = frame(R"({"msgid":"3"})");
-const std::string kOne = frame(R"({"msgid":"1"})", "~#\n#~");
 const std::string kFour = frame(R"({"msgid":"4"})");
-const std::string kAll = R"(3:{"msgid":"3"}:;1:{"msgid":"1"}:)"
-                         "~#\n#~"
-                         R"(;4:{"msgid":"4"}:;)";
 
 class Reassembly : public testing::Test
 {
@@ -33,16 +29,6 @@ protected:
 
     log_reassembly state_;
 };
-
-TEST_F(Reassembly, HandlesFramesSplitAtEveryPosition)
-{
-    const std::string stream = kThree + kOne + kFour;
-    for (std::size_t cut = 0; cut <= stream.size(); ++cut) {
-        const std::string before = feed(stream.substr(0, cut));
-        ASSERT_EQ(kAll, before + feed(stream.substr(cut))) << cut;
-        EXPECT_EQ(0u, state_.recv_pkg_len);
-    }
-}
 
 TEST_F(Reassembly, DropsABadFrameAndHandlesTheGoodOneBehindIt)
 {
