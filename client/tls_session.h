@@ -28,7 +28,8 @@ bool tls_session_connect(SSL *session, tls_clock::time_point end);
 int tls_session_read(SSL *session, void *bytes, int len);
 
 /* Writes all `len` bytes, more than 0, and waits until the socket has taken them: `len`; 0 or less, and errno, on
- * failure. What several threads write stays in one piece each. */
+ * failure. What several threads write stays in one piece each. With a failure of the socket the session is over: the
+ * socket is shut down, and nothing more is sent, not even what was waiting. */
 int tls_session_write(SSL *session, const void *bytes, int len);
 
 /* From now on what is written may wait until there is enough of it for the network, or no longer: then all of it is

@@ -48,10 +48,11 @@ void forget_nv()
 void install_program(const std::string &name, const std::string &script)
 {
     const std::string path = "/usr/vex/override/" + name;
-    std::ofstream file(path);
+    const std::string beside = path + ".new"; /* the program may be starting just now, and cannot be written to then */
+    std::ofstream file(beside);
     file << "#!/bin/sh\n" << script;
     file.close();
-    if (!file || chmod(path.c_str(), 0755) != 0) {
+    if (!file || chmod(beside.c_str(), 0755) != 0 || std::rename(beside.c_str(), path.c_str()) != 0) {
         std::perror(path.c_str());
         std::abort();
     }
