@@ -10,18 +10,18 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <fcntl.h>
 #include <memory>
 #include <netdb.h>
+#include <poll.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 namespace
 {
 
 constexpr char kLogSource[] = "vex_log_manage";
 
-constexpr useconds_t kShortPause = 1000; /* microseconds after a failed try, */
-constexpr unsigned kLongPause = 2;       /* and seconds more */
+constexpr int kPause = 1 + 2000; /* milliseconds after a failed try */
 
 struct address_list_deleter {
     void operator()(addrinfo *list) const { freeaddrinfo(list); }
@@ -85,22 +85,48 @@ void log_failure(const server_name &name)
     LOG_NOTE("fail connect to address: %s, port number: %d\n", name.address, name.port);
 }
 
-/* Connects the socket; false, after the log lines, when no try succeeded. */
-bool try_to_connect(int fd, const addrinfo &server, const server_name &name, const log_link *link)
+/* Waits until the connection is not wanted any more, for a time or, with -1, until `fd` can be written to. */
+bool stopped(int fd, int stop_fd, int milliseconds)
 {
-    const auto wanted = [link] { return link == nullptr || log_link_wanted(*link); };
-    for (int tries = 0; tries < g_daemon.retry_count && wanted(); ++tries) {
-        if (connect(fd, server.ai_addr, server.ai_addrlen) == 0)
+    pollfd entries[] = {{fd, POLLOUT, 0}, {stop_fd, POLLIN, 0}};
+    poll(entries, 2, milliseconds);
+    return entries[1].revents != 0;
+}
+
+/* One try; 0, or the error. A call on a socket that is being connected tells what has come of it. */
+int connect_once(int fd, const addrinfo &server, int stop_fd)
+{
+    while (connect(fd, server.ai_addr, server.ai_addrlen) != 0) {
+        if (errno != EINPROGRESS && errno != EALREADY && errno != EINTR)
+            return errno;
+        if (stopped(fd, stop_fd, -1))
+            return ECANCELED;
+    }
+    return 0;
+}
+
+void set_non_blocking(int fd, bool on)
+{
+    const int flags = fcntl(fd, F_GETFL);
+    fcntl(fd, F_SETFL, on ? flags | O_NONBLOCK : flags & ~O_NONBLOCK);
+}
+
+/* Connects the socket; false, after the log lines, when no try succeeded. */
+bool try_to_connect(int fd, const addrinfo &server, const server_name &name, int stop_fd)
+{
+    for (int tries = 0; tries < g_daemon.retry_count && !stopped(-1, stop_fd, 0); ++tries) {
+        const int error = connect_once(fd, server, stop_fd);
+        if (error == 0)
             return true;
-        const int error = errno;
+        if (error == ECANCELED)
+            break;
         if (error == EISCONN) {
             LOG_FAULT("Socket %d already connected, errno: %d\n", fd, error);
             return true;
         }
         if (!may_try_again(error))
             return false;
-        usleep(kShortPause);
-        sleep(kLongPause);
+        stopped(-1, stop_fd, kPause);
     }
     log_failure(name);
     return false;
@@ -108,7 +134,7 @@ bool try_to_connect(int fd, const addrinfo &server, const server_name &name, con
 
 } // namespace
 
-int log_connect_server(const char *host, int port, SSL **session, const log_link *link)
+int log_connect_server(const char *host, int port, std::unique_ptr<log_tls_session> *session, int stop_fd)
 {
     const address_list server = translate(host, port);
     if (!server)
@@ -123,9 +149,11 @@ int log_connect_server(const char *host, int port, SSL **session, const log_link
     name.port = port;
     render(*server, &name);
     LOG_NOTE("Trying to connect to address: %s, port: %d\n", name.address, port);
-    if (!try_to_connect(sock.get(), *server, name, link))
+    set_non_blocking(sock.get(), true);
+    if (!try_to_connect(sock.get(), *server, name, stop_fd))
         return -1;
-    if (vex_open_ssl(sock.get(), session) != 1) {
+    set_non_blocking(sock.get(), false); /* a log program is given it, without TLS */
+    if (vex_open_ssl(sock.get(), session, stop_fd) != 1) {
         log_failure(name);
         return -1;
     }

@@ -1,10 +1,8 @@
 #include "client/log_tls.h"
 
-#include "client/tls_library.h"
-#include "client/tls_session.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
-#include "core/log_lock.h"
+#include "core/log_tls_library.h"
 
 #include <cerrno>
 #include <chrono>
@@ -22,16 +20,12 @@ constexpr char kKeyFile[] = "/usr/vex/vex_conf/logcert/logkey.pem";
 
 constexpr auto kHandshakeMax = std::chrono::seconds(30);
 
-/* Guards the pointer to the context, which is given up while a data link may be opening a session. */
-log_mutex g_context_lock;
-SSL_CTX *g_ssl_ctx LOG_GUARDED_BY(g_context_lock);
-
 /* Logs a name of the certificate as one line. */
 void log_name(const char *what, const X509_NAME *name)
 {
     char *const line = g_tls.X509_NAME_oneline(name, nullptr, 0);
     LOG_NOTE("[%s]: certification %s is '%s'", "log_cert_check", what, line != nullptr ? line : "");
-    g_tls.CRYPTO_free(line, __FILE__, __LINE__);
+    g_tls.CRYPTO_free(line, "log_tls.cpp", __LINE__);
 }
 
 /* Loads the device's certificates; false, after the log line of what is wrong. */
@@ -59,22 +53,22 @@ bool load_files(SSL_CTX *context)
 }
 
 /* A session on the socket; null without a context or memory. */
-SSL *new_session(int fd)
+std::unique_ptr<log_tls_session> new_session(int fd, int stop_fd)
 {
-    const log_lock hold{g_context_lock};
-    return g_ssl_ctx != nullptr ? tls_session_new(g_ssl_ctx, fd) : nullptr;
+    const log_lock hold{g_daemon.ssl_ctx_lock};
+    return g_daemon.ssl_ctx != nullptr ? log_tls_session::open(g_daemon.ssl_ctx, fd, stop_fd) : nullptr;
 }
 
 /* A session on the socket that has shaken hands with the server; null when it has not (logged). */
-SSL *shake_hands(int fd)
+std::unique_ptr<log_tls_session> shake_hands(int fd, int stop_fd)
 {
     errno = 0;
-    SSL *const session = new_session(fd);
-    if (session != nullptr && tls_session_connect(session, tls_clock::now() + kHandshakeMax))
+    std::unique_ptr<log_tls_session> session = new_session(fd, stop_fd);
+    if (session && session->connect(log_clock::now() + kHandshakeMax))
         return session;
     const int error = errno;
-    if (session != nullptr)
-        tls_session_free(session);
+    if (session)
+        session->close(log_clock::now());
     LOG_FAULT("%s: SSL connect error %s errno: %d\n", "vex_open_ssl", std::strerror(error), error);
     return nullptr;
 }
@@ -84,54 +78,54 @@ SSL *shake_hands(int fd)
 log_tls_result log_tls_start()
 {
     g_daemon.use_ssl = 1;
-    g_daemon.ssl_read = tls_session_read;
-    g_daemon.ssl_write = tls_session_write;
-    g_daemon.ssl_hold = tls_session_hold;
-    g_daemon.close_ssl = vex_close_ssl;
-    if (!tls_library_load())
+    std::string why;
+    if (!log_tls_library_load(why)) {
+        LOG_FAULT("%s", why.c_str());
         return log_tls_result::no_context;
+    }
     g_tls.OPENSSL_init_ssl(0, nullptr);
     g_tls.OPENSSL_init_crypto(OPENSSL_INIT_ADD_ALL_CIPHERS | OPENSSL_INIT_ADD_ALL_DIGESTS, nullptr);
     g_tls.OPENSSL_init_ssl(OPENSSL_INIT_LOAD_SSL_STRINGS | OPENSSL_INIT_LOAD_CRYPTO_STRINGS, nullptr);
     SSL_CTX *const context = g_tls.SSL_CTX_new(g_tls.TLS_client_method());
-    if (context == nullptr || !tls_session_prepare()) {
+    if (context == nullptr) {
         LOG_FAULT("**SOCKET: Create SSL_CTX error...\n");
         g_tls.ERR_print_errors_fp(stderr);
         return log_tls_result::no_context;
     }
     g_tls.SSL_CTX_set_verify(context, SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
-    /* A TLS 1.2 server may not begin anew: a write of one thread would have to take part in what another reads. */
+    /* A TLS 1.2 server may not renegotiate: a write of one thread would have to take part in what another reads. */
     g_tls.SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION);
     if (!load_files(context)) {
         g_tls.SSL_CTX_free(context);
         return log_tls_result::bad_files;
     }
-    tls_library_settle();
-    const log_lock hold{g_context_lock};
-    g_ssl_ctx = context;
+    log_tls_library_settle();
+    const log_lock hold{g_daemon.ssl_ctx_lock};
+    g_daemon.ssl_ctx = context;
     return log_tls_result::ready;
 }
 
-int vex_open_ssl(int fd, SSL **session)
+int vex_open_ssl(int fd, std::unique_ptr<log_tls_session> *session, int stop_fd)
 {
     if (g_daemon.use_ssl != 1)
         return 1;
-    *session = shake_hands(fd);
+    *session = shake_hands(fd, stop_fd);
     if (*session == nullptr)
         return 0;
-    LOG_NOTE("Connected with %s encryption!!!", g_tls.SSL_CIPHER_get_name(g_tls.SSL_get_current_cipher(*session)));
-    if (log_cert_check(*session) == 0) {
-        tls_session_free(*session);
-        *session = nullptr;
+    const SSL_CIPHER *const cipher = g_tls.SSL_get_current_cipher((*session)->handle());
+    LOG_NOTE("Connected with %s encryption!!!", g_tls.SSL_CIPHER_get_name(cipher));
+    if (log_cert_check(**session) == 0) {
+        (*session)->close(log_clock::now());
+        session->reset();
         return 0;
     }
     LOG_NOTE("very good ,log_server check ok \n");
     return 1;
 }
 
-int log_cert_check(SSL *session)
+int log_cert_check(const log_tls_session &session)
 {
-    const long result = g_tls.SSL_get_verify_result(session);
+    const long result = g_tls.SSL_get_verify_result(session.handle());
     const int code = static_cast<int>(result);
     LOG_NOTE("[%s]:certificate verify return code %d", __func__, code);
     if (result != X509_V_OK) {
@@ -141,7 +135,7 @@ int log_cert_check(SSL *session)
         return 0;
     }
     LOG_FAULT("[%s]:certificate ok", __func__);
-    const std::unique_ptr<X509, decltype(g_tls.X509_free)> certificate{g_tls.SSL_get_peer_certificate(session),
+    const std::unique_ptr<X509, decltype(g_tls.X509_free)> certificate{g_tls.SSL_get_peer_certificate(session.handle()),
                                                                        g_tls.X509_free};
     if (!certificate) {
         LOG_FAULT("[%s]: NO certification info!!!!", __func__);
@@ -157,20 +151,20 @@ int log_cert_check(SSL *session)
     return 1;
 }
 
-void vex_close_ssl(SSL *session, int free_context)
+void vex_close_ssl(log_tls_session *session, int free_context, log_clock::time_point end)
 {
     if (g_daemon.use_ssl != 1)
         return;
     if (session != nullptr) {
-        tls_session_free(session);
+        session->close(end);
         LOG_NOTE("**SOCKET: server_ssl free return\n");
     }
     if (free_context != 1)
         return;
     SSL_CTX *context = nullptr;
     {
-        const log_lock hold{g_context_lock};
-        std::swap(context, g_ssl_ctx);
+        const log_lock hold{g_daemon.ssl_ctx_lock};
+        std::swap(context, g_daemon.ssl_ctx);
     }
     if (context == nullptr)
         return;

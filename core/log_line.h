@@ -15,9 +15,12 @@
 constexpr int kLogModule = 84; /* this daemon's code in the maker's log */
 
 /* Progress, and errors that a peer can cause. */
-#define LOG_NOTE(...) vex_syslog_append(6, kLogSource, __LINE__, kLogModule, __VA_ARGS__)
+#define LOG_NOTE(...) LOG_NOTE_AS(kLogSource, __VA_ARGS__)
 
 /* A failure of the system or of TLS. */
 #define LOG_FAULT(...) vex_syslog_append(0, kLogSource, __LINE__, kLogModule, __VA_ARGS__)
+
+/* A line in the name of another source. */
+#define LOG_NOTE_AS(source, ...) vex_syslog_append(6, source, __LINE__, kLogModule, __VA_ARGS__)
 
 #endif

@@ -5,6 +5,7 @@
 #include <csignal>
 #include <dirent.h>
 #include <fcntl.h>
+#include <malloc.h>
 #include <unistd.h>
 
 namespace
@@ -32,6 +33,17 @@ void close_inherited_on_exec()
     closedir(open_fds);
 }
 
+/* A connection takes up its frames' records when it comes and gives them back when it goes. Memory that the allocator
+ * then returned to the system would be fetched again for the next one, which makes connecting a twentieth slower. */
+#ifdef M_TRIM_THRESHOLD
+void keep_freed_memory()
+{
+    mallopt(M_TRIM_THRESHOLD, 1 << 20);
+}
+#else
+void keep_freed_memory() {}
+#endif
+
 /* Unlike SIG_IGN, a handler is not inherited by the programs that the daemon starts. */
 void on_broken_pipe(int /*signal*/) {}
 
@@ -41,6 +53,7 @@ void log_prepare_process()
 {
     open_standard_streams();
     close_inherited_on_exec();
+    keep_freed_memory();
     struct sigaction action {
     };
     action.sa_handler = on_broken_pipe;

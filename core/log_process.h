@@ -5,8 +5,8 @@
 /*
  * Opens /dev/null as every standard stream that the starter left closed, so that no socket can become one; keeps
  * whatever else the starter left open from the programs that the daemon starts; makes a write to a peer that went
- * away fail instead of killing the process, which is not passed on to those programs; and makes sure that their end
- * can be waited for. Called first in main(), once.
+ * away fail instead of killing the process, which is not passed on to those programs; makes sure that their end can
+ * be waited for; and has freed memory kept for the next connection. Called first in main(), once.
  */
 void log_prepare_process();
 

@@ -1,57 +1,65 @@
 /*
- * The connection registry: which sockets and TLS sessions the daemon talks on, who may use them, and who closes them.
- *
- * A connection has one owner, the thread that reads it. The owner alone closes it, at its own end. Others may
- *   - take it away: reset its fields here and shut its socket down, which wakes its reader and a sender that blocks
- *     on it. The number stays taken until the owner is done, so it can never mean another connection meanwhile.
- *   - send on it: through log_cmd_use, which holds the link for one frame, so that frames of several threads never
- *     mix and the owner waits with its close until the frame is out or has failed.
+ * The connection registry: which sockets and TLS sessions the daemon talks on, and who may use them.
  *
  * The locks of the daemon, in the order in which one may be taken while another is held:
  *
- *   g_takeover_lock  one accepted connection at a time takes the place of another
- *   producer_lock    of a stream: one thread at a time deals with its log program (core/log_streams.h), and
- *   send_lock        of a stream: one send at a time on its data link
- *   g_cmd_send_lock  one frame at a time on the command connection: held while it is sent (log_cmd_use)
- *   g_registry_lock  the fields of the registry. Held for a few instructions: no waiting for a peer, sending, logging
- *                    or starting of threads and programs
- *   g_block_lock     the blocks that wait for their next use (core/log_block.h); as short
- *   g_restart_lock   the latest restart of the local system log (core/log_local_syslog.cpp); as short
- *   g_context_lock   the TLS context (client/log_tls.cpp), and
- *   a session's own  one library call on it (client/tls_session.cpp): both are taken last
+ *   g_takeover_lock      one accepted connection at a time takes over the command connection
+ *   a link's `sending`   one frame at a time on a link (core/log_link.h): held while it is sent
+ *   a log's `run_lock`   one start of a log program at a time, and the wait of a few seconds for what is in its way
+ *                        (core/log_programs.h)
+ *   ssl_ctx_lock         the TLS context (core/daemon_state.h)
+ *   g_registry_lock      the fields of the registry, and the live streams (client/log_stream.cpp). Held for a few
+ *                        instructions: no waiting for a peer, sending, logging or starting of threads and programs
+ *   a session's `lock_`  one library call on it (core/log_tls_session.h)
+ *   bsp_record_lock      one change of the record of kernel-module levels at a time (handlers/bsp_module_level.cpp)
  */
 #ifndef CORE_LOG_REGISTRY_H
 #define CORE_LOG_REGISTRY_H
 
-#include "core/log_lock.h"
+#include "core/log_link.h"
 
-#include <cstddef>
-#include <openssl/ossl_typ.h>
+#include <memory>
 #include <pthread.h>
 
-extern log_mutex g_takeover_lock;
-extern log_mutex g_cmd_send_lock;
 extern log_mutex g_registry_lock;
-extern log_mutex g_block_lock;
+extern log_mutex g_takeover_lock LOG_ACQUIRED_BEFORE(g_registry_lock);
 
 struct log_sock_fd {
-    int cmd_fd = -1;        /* the command connection: a log tool, or the control link; -1: none, here and below */
-    SSL *cmd_ssl = nullptr; /* its session; null without TLS, here and below */
-    int qxdm_fd = -1;       /* the modem-log data link */
-    SSL *qxdm_ssl = nullptr;
+    int cmd_fd = -1;                    /* the command connection: a log tool, or the control link; -1: none, here and
+                                           below */
+    log_tls_session *cmd_ssl = nullptr; /* its session; null without TLS, here and below */
+    int qxdm_fd = -1;                   /* the modem-log data link */
+    log_tls_session *qxdm_ssl = nullptr;
     int syslog_fd = -1; /* the system-log data link */
-    SSL *syslog_ssl = nullptr;
+    log_tls_session *syslog_ssl = nullptr;
 };
 
 extern log_sock_fd g_sock_fd LOG_GUARDED_BY(g_registry_lock);
 
 /* Address of the connected log tool, as text. */
-constexpr std::size_t kClientIpSize = 64;
 extern char client_ip[kClientIpSize] LOG_GUARDED_BY(g_registry_lock);
 
-/* The thread that reads the command connection in server mode; 0: none yet, or no more. It stands here only while the
- * thread lives, so that cancelling it is safe under the lock. */
+/* The thread that reads the command connection in server mode; 0: none yet, or no more. */
 extern pthread_t recv_thread_id LOG_GUARDED_BY(g_registry_lock);
+
+/* Where the server wants a stream to go. */
+struct log_target {
+    char ip[64] = {};
+    int port = 0;
+};
+
+extern log_target syslog_target LOG_GUARDED_BY(g_registry_lock);
+extern log_target qxdm_target LOG_GUARDED_BY(g_registry_lock);
+
+/* Our ends of the connections to the intakes, which the log programs have copies of; -1: none. */
+extern int syslog_local_fd LOG_GUARDED_BY(g_registry_lock);
+extern int qxdm_local_fd LOG_GUARDED_BY(g_registry_lock);
+
+/* Takes a link away from its owner: its reading ends, no command of it is run any more, and what its owner still has to
+ * say in server mode reaches nobody. A link over TLS also needs to be stopped (log_tls_session::open). */
+void log_link_take_away(log_link &link);
+
+/* ---- The command connection ---- */
 
 /* The command connection's descriptor, for the log only; -1 when there is none. */
 int log_cmd_fd();
@@ -59,76 +67,54 @@ int log_cmd_fd();
 /* A command connection that was taken away, for the log only. */
 struct log_cmd_taken {
     int fd;           /* -1: there was none */
-    pthread_t reader; /* the thread that was cancelled; 0: none */
+    pthread_t reader; /* the thread that reads it; 0: none */
 };
 
-/* Takes the command connection away from its owner, whose reading it cancels, or closes it where it has none. */
+/* Takes the command connection away from its owner, if it has one. */
 log_cmd_taken log_cmd_take_away() LOG_REQUIRES(g_takeover_lock);
 
-/* Records a log tool's connection as the command connection, owned by the thread that is about to be started for it, or
- * by nobody after log_cmd_disown(). */
-void log_cmd_record(int fd, const char *ip) LOG_REQUIRES(g_takeover_lock);
-void log_cmd_disown() LOG_REQUIRES(g_takeover_lock);
+/* Records a link as the command connection. */
+void log_cmd_record(const std::shared_ptr<log_link> &link);
 
-/* Records the control link of client mode: its session, then its socket, owned by the calling thread. */
-void log_cmd_record_session(SSL *session);
-void log_cmd_record_link(int fd);
+/* The command connection for a reply of the calling thread; null when there is none, or a log tool that this thread
+ * serves has been replaced by another. */
+std::shared_ptr<log_link> log_cmd_link();
 
-/* The command connection's session; null without TLS. For its owner. */
-SSL *log_cmd_session();
+/* The owner's last step: forgets the command connection, unless another has taken it over. */
+void log_cmd_forget(const log_link &link);
 
-/* The address of the log tool whose command connection the calling thread owns, also when another tool has taken its
- * place; empty for a thread that owns none. */
-const char *log_cmd_client_ip();
+/* ---- For the thread that reads a link ---- */
 
-/* Declares the calling thread to be the owner of the command connection `fd`. From now on its commands run,
- * and its replies go out, only while `fd` is still the command connection. A thread that never says so, like
- * one that reads a data link, answers on whatever command connection there is. */
-void log_cmd_serve(int fd);
+/* While this lives, the calling thread serves the link, whose owner it is. */
+class log_serving
+{
+public:
+    explicit log_serving(log_link &link);
+    ~log_serving();
+    log_serving(const log_serving &) = delete;
+    log_serving &operator=(const log_serving &) = delete;
+};
 
-/* Whether the calling thread's command connection is still the daemon's; true for a thread that owns none. */
-bool log_cmd_stands();
-
-/*
- * The owner's last step: forgets the command connection `fd` unless another has taken its place, waits for a
- * frame that is just being sent on it, and closes it, after its session and the context of all sessions.
- */
-void log_cmd_close(int fd);
+/* The link that the calling thread serves; null: none. */
+log_link *log_served();
 
 /*
- * A turn to run a command. One thread has it at a time: a tool that took another's place waits here until the other's
- * command has ended, and a data link for the control link. A thread whose connection is taken away meanwhile waits no
- * longer; it gets no turn. A command that may run beside others gets its turn at once.
+ * A turn to run a command that does not run beside others. One thread has it at a time: a tool that took over from
+ * another waits here until the other's command has ended. A thread whose link is taken away meanwhile waits no longer;
+ * it gets no turn, nor does one whose link was taken away before.
  */
 class log_cmd_turn
 {
 public:
-    explicit log_cmd_turn(bool beside_others);
+    explicit log_cmd_turn(bool alone); /* false: the command may run beside others */
     ~log_cmd_turn();
     log_cmd_turn(const log_cmd_turn &) = delete;
     log_cmd_turn &operator=(const log_cmd_turn &) = delete;
     bool granted() const { return granted_; }
 
 private:
+    const bool alone_;
     bool granted_ = false;
-    bool taken_ = false; /* and to be given back */
-};
-
-/* The command connection, held for one frame. fd() is -1 when there is none or this thread has lost its own. */
-class log_cmd_use
-{
-public:
-    log_cmd_use();
-    ~log_cmd_use();
-    log_cmd_use(const log_cmd_use &) = delete;
-    log_cmd_use &operator=(const log_cmd_use &) = delete;
-    int fd() const { return fd_; }
-    SSL *ssl() const { return ssl_; }
-
-private:
-    log_lock sending_;
-    int fd_ = -1;
-    SSL *ssl_ = nullptr;
 };
 
 #endif

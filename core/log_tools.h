@@ -1,6 +1,6 @@
 /*
  * The thin layer between the daemon's logic and its device: NV items, shell commands, whole sends, threads,
- * address texts, hex dumps, platform messages, local sockets.
+ * address texts, hex dumps, platform messages, local sockets. Each has a source of its own, log_tools_*.cpp.
  *
  * Every service may be called from any thread, keeps no state and ends nothing on bad input: it reports by
  * its result, and logs what is said here as "log_tools". Pointers are borrowed for the call.
@@ -9,9 +9,10 @@
 #define CORE_LOG_TOOLS_H
 
 #include <cstdint>
-#include <openssl/ossl_typ.h>
 #include <pthread.h>
 #include <sys/types.h>
+
+class log_tls_session;
 
 /* ---- Threads ---- */
 
@@ -23,6 +24,9 @@ struct log_thread_task {
 /* Starts `task->entry` with `argument` as a detached thread of 256 KB of stack and stores its id in the task. 0
  * started, -1 failed; only a missing task is logged, the caller logs its own failure. */
 int log_thread_create(log_thread_task *task, void *argument);
+
+/* The same in one step: 0 started; -1 after a log line in the name of `starter`, as "vex_log_manage". */
+int log_start_thread(const char *starter, void *(*entry)(void *), void *argument = nullptr);
 
 /* ---- NV items ---- */
 
@@ -52,9 +56,16 @@ int log_exec_cmd(const char *cmdStr);
 /* The same for a line whose program is told a descriptor by its number: it alone inherits `handed_fd`. */
 int log_exec_cmd_with(const char *cmdStr, int handed_fd);
 
-/* The same for a line whose programs are to be a process group of their own: the group's number; 0 when no shell
- * could be run. */
-pid_t log_exec_cmd_apart(const char *cmdStr);
+/* The same for a line that ends in "&" whose program is to be known: it is a child that is not waited for. Its number,
+ * by which it must be asked for or ended one day; -1 when it could not be started. */
+pid_t log_exec_cmd_behind(const char *cmdStr);
+
+/* Whether such a child has ended; then it is forgotten and its number is not to be used any more. */
+bool log_child_ended(pid_t child);
+
+/* Waits until such a child has ended and forgets it. After 3 seconds it is asked to (SIGTERM), after 2 more killed, both
+ * of which is logged; what it has started itself is left alone. */
+void log_end_child(pid_t child);
 
 /* Runs the shell command line and captures the first line of its output, without its newline and cut at size
  * - 1 characters, in `buffer` of `size` bytes, which is cleared first. 1 captured, 0 nothing to capture. */
@@ -65,9 +76,10 @@ int vex_popen(const char *cmd, char *buffer, int size);
 /*
  * Sends `len` bytes whole on the socket, or on the TLS session when the daemon runs over TLS. Returns `len`,
  * or -1 on the first failure, which is never retried; a negative length returns 0. Says on standard output,
- * not in the log, what became of it. The caller holds the link while it sends.
+ * not in the log, what became of it. The caller keeps other
+ * senders off the connection meanwhile.
  */
-int log_send_packet(int fd, SSL *ssl, const void *buffer, int len);
+int log_send_packet(int fd, log_tls_session *ssl, const void *buffer, int len);
 
 /* Has a connection found dead after 90 seconds of silence: its peer is probed after 60 seconds, then three times 10
  * seconds apart. What a listener accepts inherits it. */

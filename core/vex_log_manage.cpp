@@ -1,16 +1,15 @@
 /* The daemon's entry point: start-up, then the wait for its end. All work is done on the threads started
  * here. */
 #include "client/log_client_ctl.h"
+#include "client/log_stream.h"
 #include "client/log_tls.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
-#include "core/log_local_syslog.h"
 #include "core/log_options.h"
 #include "core/log_process.h"
-#include "core/log_streams.h"
+#include "core/log_programs.h"
 #include "core/log_tools.h"
 #include "handlers/bsp_module_level.h"
-#include "protocol/json_memory.h"
 #include "transport/log_server.h"
 
 #include <charconv>
@@ -47,20 +46,9 @@ int read_run_mode()
     return log_text_to_int(mode);
 }
 
-void start_system_log()
-{
-    char path[16] = {};
-    char level[16] = {};
-    char size[16] = {};
-    vex_get_nv_item("syslog_path", path, sizeof path);
-    vex_get_nv_item("syslog_level", level, sizeof level);
-    vex_get_nv_item("syslog_size", size, sizeof size);
-    log_run_syslog_script(path, level, size, log_script_wait::yes);
-}
-
 void run_server_mode()
 {
-    start_system_log();
+    log_start_local_syslog();
     vex_log_server_thread();
     vex_log_server_thread_ipv6();
 }
@@ -81,8 +69,10 @@ int run_client_mode()
 
 void wait_for_exit()
 {
-    while (g_daemon.exit_flag == 0)
+    while (g_daemon.exit_flag == 0) {
         sleep(kExitPoll);
+        log_reap_programs();
+    }
 }
 
 } // namespace
@@ -90,7 +80,6 @@ void wait_for_exit()
 int main(int argc, char **argv)
 {
     log_prepare_process();
-    json_memory_install();
     LOG_NOTE("start vex_log_manage...\n");
     if (log_parse_options(argc, argv) == log_options_result::help)
         return 0;
@@ -103,7 +92,7 @@ int main(int argc, char **argv)
     else if (const int status = run_client_mode(); status != 0)
         return status;
     wait_for_exit();
-    log_streams_shut_down();
+    log_streams_end_all();
     std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
     _exit(0);            /* other threads still run: nothing that they use may be torn down */
 }

@@ -10,6 +10,7 @@
 #include <link.h>
 #include <netinet/in.h>
 #include <pthread.h>
+#include <spawn.h>
 #include <sys/mman.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -124,6 +125,13 @@ void *calloc(size_t count, size_t size)
                                                        : real(count, size);
 }
 
+void *realloc(void *memory, size_t size)
+{
+    static auto *const real = next(realloc, "realloc");
+    return strikes_memory(__builtin_return_address(0)) ? fails<void *>(kFaultMemory, nullptr, ENOMEM)
+                                                       : real(memory, size);
+}
+
 void *aligned_alloc(size_t alignment, size_t size)
 {
     static auto *const real = next(aligned_alloc, "aligned_alloc");
@@ -185,22 +193,11 @@ int fsync(int fd)
     return strikes(kFaultFsync) ? fails(kFaultFsync, -1, EIO) : real(fd);
 }
 
-int system(const char *command)
+int posix_spawn(pid_t *child, const char *path, const posix_spawn_file_actions_t *actions,
+                const posix_spawnattr_t *attributes, char *const *words, char *const *environment)
 {
-    static auto *const real = next(system, "system");
-    return strikes(kFaultSystem) ? fails(kFaultSystem, -1, ENOMEM) : real(command);
-}
-
-FILE *popen(const char *command, const char *type)
-{
-    static auto *const real = next(popen, "popen");
-    return strikes(kFaultPopen) ? fails<FILE *>(kFaultPopen, nullptr, ENOMEM) : real(command, type);
-}
-
-pid_t fork()
-{
-    static auto *const real = next(fork, "fork");
-    return strikes(kFaultFork) ? fails(kFaultFork, -1, EAGAIN) : real();
+    static auto *const real = next(posix_spawn, "posix_spawn");
+    return strikes(kFaultSpawn) ? EAGAIN : real(child, path, actions, attributes, words, environment);
 }
 
 ssize_t send(int fd, const void *bytes, size_t len, int flags)

@@ -9,7 +9,7 @@
 #include <atomic>
 
 enum fault_call {
-    kFaultMemory, /* malloc, calloc, aligned_alloc; by the program itself, not by its libraries */
+    kFaultMemory, /* malloc, calloc, realloc, aligned_alloc; by the program itself, not by its libraries */
     kFaultThread, /* pthread_create */
     kFaultSocket,
     kFaultBind,
@@ -17,9 +17,7 @@ enum fault_call {
     kFaultAccept, /* accept4 */
     kFaultOpen,   /* open and fopen */
     kFaultFsync,
-    kFaultSystem,
-    kFaultPopen,
-    kFaultFork,
+    kFaultSpawn, /* posix_spawn */
     kFaultSend,
     kFaultRecv,
     kFaultCalls

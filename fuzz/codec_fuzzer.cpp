@@ -4,6 +4,7 @@
  */
 #include "fuzz/fuzz.h"
 #include "protocol/log_pkg_codec.h"
+#include "tests/frame.h"
 #include "tests/memory_platform.h"
 
 #include <memory>
@@ -15,14 +16,9 @@ namespace
 /* What the codec has to take for a frame, by its description. */
 bool is_frame(std::string_view bytes)
 {
-    const auto *const at = reinterpret_cast<const unsigned char *>(bytes.data());
-    if (bytes.size() < kPkgMin || !bytes.starts_with(PKG_HEAD) || !bytes.ends_with(PKG_TAIL))
-        return false;
-    const std::uint64_t control_len = log_pkg_get_u32(at + kPkgControlLenAt);
-    if (control_len > kPkgControlMax || kPkgMin + control_len > bytes.size())
-        return false;
-    const std::uint64_t data_len = log_pkg_get_u32(at + kPkgControlAt + control_len);
-    return data_len < kPkgDataMax && kPkgMin + control_len + data_len == bytes.size();
+    const auto parts = parts_of(bytes);
+    return parts && bytes.starts_with(PKG_HEAD) && bytes.ends_with(PKG_TAIL) && parts->size == bytes.size() &&
+           parts->control.size() <= kPkgControlMax && parts->data.size() < kPkgDataMax;
 }
 
 std::string_view data_of(const log_msg &msg)
@@ -58,11 +54,17 @@ void check_encoding(std::string_view input, log_msg *msg)
     promise((log_encode_fill_msg(control.c_str(), input.data(), data_len, msg) == 0) == fits, "what fits is taken");
     if (!fits)
         return;
-    static unsigned char room[sizeof(log_msg) + kPkgSendBuf];
-    auto *const placed = new (room) log_msg(*msg);
-    std::int32_t len = kPkgSendBuf;
-    unsigned char *const frame = log_pkg_place(placed);
-    promise(log_encode_pkg_buf(frame, &len, placed) == 0, "a filled record is encoded in its own place");
+    static log_outgoing outgoing;
+    std::int32_t len = 0;
+    input.copy(reinterpret_cast<char *>(outgoing.data()), input.size());
+    const unsigned char *const frame = log_encode_outgoing(control.c_str(), data_len, &outgoing, &len);
+    promise(frame != nullptr, "what fits can be encoded where its data lies");
+    std::int32_t record_len = kPkgSendBuf;
+    std::vector<unsigned char> of_record(kPkgSendBuf);
+    promise(log_encode_pkg_buf(of_record.data(), &record_len, msg) == 0 &&
+                text_of(of_record.data(), static_cast<std::size_t>(record_len)) ==
+                    text_of(frame, static_cast<std::size_t>(len)),
+            "and from a record, to the same bytes");
     log_msg_clear(msg);
     const bool decoded = log_decode_msg(frame, static_cast<std::size_t>(len), msg) == 0;
     promise(decoded == (input.size() < kPkgDataMax), "what was encoded is decoded");

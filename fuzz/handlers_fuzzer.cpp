@@ -1,23 +1,22 @@
 /*
  * Every handler's control text, on a device whose commands are written down instead of run. Every request is
  * answered once, by a frame that bears its number and has a control text of at most its bound; what is uploaded and
- * what is fetched arrives, and is not changed on its way. The memory for JSON is the daemon's, and gives out no byte
- * twice.
+ * what is fetched arrives, and is not changed on its way.
  *
  * The first byte of an input says how the device is (see device_traits). The rest is up to four control texts, one a
  * line; a NUL, then NV items, NAME=VALUE, one a line; a NUL, then what programs print.
  */
 #include "core/daemon_state.h"
 #include "core/log_registry.h"
-#include "core/log_streams.h"
+#include "core/log_tls_session.h"
 #include "core/log_tools.h"
 #include "fuzz/fuzz.h"
 #include "fuzz/recorded_device.h"
 #include "handlers/handlers.h"
 #include "platform/unique_fd.h"
-#include "protocol/json_memory.h"
 #include "protocol/log_json_codec.h"
 #include "protocol/log_pkg_codec.h"
+#include "tests/frame.h"
 #include "tests/memory_platform.h"
 #include "transport/log_intake.h"
 
@@ -65,7 +64,6 @@ struct tool_end {
     tool_end()
     {
         int ends[2] = {-1, -1};
-        json_memory_install();
         promise(socketpair(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK, 0, ends) == 0, "a socket pair");
         fd.reset(ends[1]);
         g_link = ends[0];
@@ -87,15 +85,13 @@ struct reply {
 reply take_reply(std::string_view &bytes)
 {
     static const auto msg = std::make_unique<log_msg>();
-    const auto *const at = reinterpret_cast<const unsigned char *>(bytes.data());
-    promise(bytes.size() >= kPkgMin, "a reply is a frame");
-    const std::uint32_t control_len = log_pkg_get_u32(at + kPkgControlLenAt);
-    promise(control_len <= kPkgControlMax && kPkgMin + control_len <= bytes.size(), "a reply is bounded");
-    const std::size_t len = kPkgMin + control_len + log_pkg_get_u32(at + kPkgControlAt + control_len);
+    const auto parts = parts_of(bytes);
+    promise(parts && parts->control.size() <= kPkgControlMax, "a reply is a frame, and bounded");
     log_msg_clear(msg.get());
-    promise(len <= bytes.size() && log_decode_msg(at, len, msg.get()) == 0, "a reply is a whole frame");
-    bytes.remove_prefix(len);
-    return {{msg->control, control_len}, std::string(text_of(msg->data, static_cast<std::size_t>(msg->dataLen)))};
+    promise(log_decode_msg(reinterpret_cast<const unsigned char *>(bytes.data()), parts->size, msg.get()) == 0,
+            "a reply is a whole frame");
+    bytes.remove_prefix(parts->size);
+    return {std::string(parts->control), std::string(parts->data)};
 }
 
 bool succeeded(const std::string &control)
@@ -127,44 +123,16 @@ std::string check_replies(const tool_end &tool, int msgid)
     return last.control;
 }
 
-/* The data links of both streams, while the device is said to have them. */
-class data_links
+/* Over TLS, replies are written to a session; here one that writes them as they are. */
+std::unique_ptr<log_tls_session> session()
 {
-public:
-    data_links()
-    {
-        for (log_link &link : links_) {
-            if (!g_device.linked)
-                continue;
-            link.start = log_stream_start(link.stream, "10.0.0.1", 5000);
-            link.fd = socket(AF_UNIX, SOCK_STREAM, 0);
-            promise(log_link_record_session(link) && log_link_record(link), "a link that is wanted stands");
-        }
-    }
-    ~data_links()
-    {
-        for (log_link &link : links_) {
-            log_stream_stop(link.stream);
-            if (link.fd != -1)
-                log_link_close(link);
-        }
-    }
-    data_links(const data_links &) = delete;
-    data_links &operator=(const data_links &) = delete;
-
-private:
-    log_link links_[2] = {{log_stream::syslog, 0}, {log_stream::qxdm, 0}};
-};
-
-int write_link(SSL *, const void *bytes, int len)
-{
-    return static_cast<int>(send(g_link, bytes, static_cast<std::size_t>(len), 0));
+    return g_device.tls ? log_tls_session::open(nullptr, g_link, -1) : nullptr;
 }
 
 void set_up(std::string_view items)
 {
     g_platform = {};
-    g_platform.takes_line = check_line;
+    g_platform.takes_line = [](const char *, const char *, va_list) {};
     g_platform.items["imei"] = "356938035643809";
     while (!items.empty()) {
         std::string_view value = take_field(items, '\n');
@@ -174,15 +142,7 @@ void set_up(std::string_view items)
     g_platform.fails = g_device.platform_fails;
     g_daemon.run_mode = g_device.client_mode ? 1 : 0;
     g_daemon.use_ssl = g_device.tls ? 1 : 0;
-    g_daemon.ssl_write = write_link;
-    g_daemon.close_ssl = [](SSL *, int) {};
     g_daemon.syslog_realtime_on = 0;
-    {
-        const log_lock hold{g_takeover_lock};
-        log_cmd_record(g_link, g_platform.items["client_ip"].c_str());
-    }
-    log_cmd_record_session(g_device.tls ? reinterpret_cast<SSL *>(&g_device) : nullptr);
-    log_cmd_serve(g_link);
 }
 
 /* Runs the requests; what they have uploaded. */
@@ -191,8 +151,7 @@ std::string run_requests(const tool_end &tool, std::string_view requests, std::s
     std::string uploaded;
     for (int i = 0; i < kRequestsMax && !requests.empty(); ++i) {
         const std::string control(take_field(requests, '\n').substr(0, kPkgControlMax));
-        json_tree tree;
-        const int msgid = log_json_get_msgid(control.c_str(), tree);
+        const int msgid = log_json_get_msgid(control.c_str());
         log_dl_msg_handle_cmd(control.c_str(), reinterpret_cast<const unsigned char *>(data.data()),
                               static_cast<std::int32_t>(data.size()));
         const bool done = succeeded(check_replies(tool, msgid));
@@ -200,21 +159,6 @@ std::string run_requests(const tool_end &tool, std::string_view requests, std::s
             uploaded += data;
     }
     return uploaded;
-}
-
-/* Pieces of the memory that trees are made of, of such sizes: each is nobody else's until it is given back. */
-void check_pieces(std::string_view sizes)
-{
-    std::vector<std::pair<std::string, void *>> pieces;
-    for (const char c : sizes.substr(0, 64)) {
-        const std::string content(static_cast<unsigned char>(c), static_cast<char>(pieces.size()));
-        pieces.emplace_back(content,
-                            std::memcpy(cJSON_malloc(content.size() + 1), content.c_str(), content.size() + 1));
-    }
-    for (const auto &[content, piece] : pieces)
-        promise(std::memcmp(piece, content.c_str(), content.size() + 1) == 0, "a piece of a tree is its own");
-    for (const auto &[content, piece] : pieces)
-        cJSON_free(piece);
 }
 
 /* What is left of one input is not for the next one. */
@@ -239,16 +183,16 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
     const std::string_view brought = input;
     g_device = device_traits(data[0]);
     const std::string_view requests = take_field(input, '\0');
-    check_pieces(requests);
     set_up(take_field(input, '\0'));
     g_output = input;
-    std::string uploaded;
-    {
-        const data_links links;
-        uploaded = run_requests(tool, requests, g_device.brings_data ? brought : "");
-    }
+    const auto link =
+        std::make_shared<log_link>(unique_fd{dup(g_link)}, session(), g_platform.items["client_ip"].c_str());
+    const log_serving serving{*link};
+    log_cmd_record(link);
+    const std::string uploaded = run_requests(tool, requests, g_device.brings_data ? brought : "");
     if (!uploaded.empty())
         promise(content_of(kPackage) == uploaded, "what was uploaded stands in the package");
     clean_up(tool);
+    log_cmd_forget(*link);
     return 0;
 }

@@ -5,10 +5,12 @@
  * The first four bytes of an input are the sizes of the pieces, in turn, so squeezed that small ones are frequent.
  * After a fifth of 0xff the bytes come again and again, in large pieces, until the buffer has been full.
  */
+#include "core/log_link.h"
 #include "fuzz/fuzz.h"
 #include "protocol/json_tree.h"
 #include "protocol/log_json_codec.h"
 #include "protocol/log_reassembly.h"
+#include "tests/frame.h"
 #include "tests/memory_platform.h"
 #include "tests/recording_handlers.h"
 
@@ -42,27 +44,15 @@ std::string command_of(std::string_view control, std::string_view data)
     return std::to_string(number) + ':' + text + ':' + std::string(data) + ';';
 }
 
-std::size_t number_at(std::string_view bytes, std::size_t at)
-{
-    return log_pkg_get_u32(reinterpret_cast<const unsigned char *>(bytes.data()) + at);
-}
-
 /* Takes the first frame off the held bytes, and adds what it commands; false when none is there yet. */
 bool model_take(std::string &held, std::string &commands)
 {
-    if (!held.starts_with(PKG_HEAD) || held.size() < kPkgControlAt)
+    const auto parts = parts_of(held);
+    if (!parts || !held.starts_with(PKG_HEAD) || held.compare(parts->size - kPkgTagLen, kPkgTagLen, PKG_TAIL) != 0)
         return false;
-    const std::size_t control_len = number_at(held, kPkgControlLenAt);
-    if (held.size() < control_len + kPkgMin)
-        return false;
-    const std::size_t data_at = kPkgControlAt + control_len + 4;
-    const std::size_t data_len = number_at(held, data_at - 4);
-    const std::size_t tail_at = data_at + data_len;
-    if (held.size() < tail_at + kPkgTagLen || held.compare(tail_at, kPkgTagLen, PKG_TAIL) != 0)
-        return false;
-    if (control_len <= kPkgControlMax && data_len < kPkgDataMax)
-        commands += command_of({held.data() + kPkgControlAt, control_len}, {held.data() + data_at, data_len});
-    held.erase(0, tail_at + kPkgTagLen);
+    if (parts->control.size() <= kPkgControlMax && parts->data.size() < kPkgDataMax)
+        commands += command_of(parts->control, parts->data);
+    held.erase(0, parts->size);
     return true;
 }
 
@@ -75,10 +65,7 @@ struct connection {
 
     void feed(std::string_view piece)
     {
-        unsigned char *const room = log_reassembly_room(state); /* where a receive loop reads to */
-        const auto *at = reinterpret_cast<const unsigned char *>(piece.data());
-        if (room != nullptr && piece.size() <= kLogPieceMax)
-            at = static_cast<const unsigned char *>(std::memcpy(room, piece.data(), piece.size()));
+        const auto *const at = reinterpret_cast<const unsigned char *>(piece.data());
         promise(log_proc_tcp_pkg(state, {at, piece.size()}) == 0, "a piece is taken");
         if (held.size() + piece.size() >= LOG_RECV_PKG_LEN)
             held.clear();

@@ -3,6 +3,7 @@
  * under its name only when the tool says so, and holds then what the frames brought; else nothing is left behind.
  */
 #include "fuzz/fuzz.h"
+#include "tests/frame.h"
 #include "tools/tool_archive.h"
 
 #include <filesystem>
@@ -34,15 +35,15 @@ bool brings(std::string_view sent, std::string_view stored)
 {
     const std::size_t total = stored.size();
     while (!stored.empty()) {
-        const auto *const at = reinterpret_cast<const unsigned char *>(sent.data());
-        const std::size_t control_len = log_pkg_get_u32(at + kPkgControlLenAt);
-        const std::size_t data_len = log_pkg_get_u32(at + kPkgControlAt + control_len);
-        const tool_answer answer = tool_read_answer(std::string(sent.substr(kPkgControlAt, control_len)), "2");
-        if (std::strtoull(tool_answer_text(answer, "GetLocalLog", "totalLength").c_str(), nullptr, 10) != total ||
-            !stored.starts_with(sent.substr(kPkgControlAt + control_len + 4, data_len)))
+        const auto parts = parts_of(sent);
+        if (!parts)
             return false;
-        stored.remove_prefix(data_len);
-        sent.remove_prefix(kPkgMin + control_len + data_len);
+        const tool_answer answer = tool_read_answer(std::string(parts->control), "2");
+        if (std::strtoull(tool_answer_text(answer, "GetLocalLog", "totalLength").c_str(), nullptr, 10) != total ||
+            !stored.starts_with(parts->data))
+            return false;
+        stored.remove_prefix(parts->data.size());
+        sent.remove_prefix(parts->size);
     }
     return true;
 }

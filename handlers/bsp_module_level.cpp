@@ -1,6 +1,7 @@
 #include "handlers/bsp_module_level.h"
 
 #include "core/log_line.h"
+#include "core/log_lock.h"
 #include "core/log_tools.h"
 #include "handlers/log_handler.h"
 
@@ -13,6 +14,8 @@ constexpr char kItem[] = "bsplog_module_level";
 constexpr int kPiecesMax = 32;
 
 constexpr std::size_t kTextSize = 64; /* a piece with its NUL */
+
+log_mutex bsp_record_lock; /* one change of the record at a time */
 
 /* One piece of the record. There is room for one character more than counts, to tell what is too long. */
 struct bsp_entry {
@@ -107,6 +110,7 @@ void log_get_bsp_module_level(const char *name, char (&level)[kBspFieldSize])
 
 int log_set_bsp_module_level(const char *name, const char *level)
 {
+    const log_lock hold{bsp_record_lock};
     char record[kBspRecordSize] = {};
     read_record(record);
     record_text out;

@@ -1,76 +1,154 @@
 #include "handlers/live_log.h"
 
+#include "client/log_stream.h"
+#include "core/daemon_state.h"
 #include "core/log_line.h"
+#include "core/log_programs.h"
+#include "core/log_registry.h"
 #include "core/log_tools.h"
-
-#include <unistd.h>
 
 namespace
 {
 
-constexpr unsigned kModemStart = 2; /* seconds until the modem log program can be connected to */
-
-constexpr char kUsbAddress[] = "192.168.255.1"; /* the device, for a PC on its USB port */
-constexpr char kUsbInterface[] = "/sys/class/net/usb0";
-
-/* Whether this is a plug-in module in a PC, which reaches it by USB only. */
-bool is_usb_module()
+live_log_answer answer(const char *protocol, int port, const char *ip)
 {
-    char product_type[16] = {};
-    vex_get_nv_item("product_type", product_type, sizeof product_type);
-    return std::strcmp(product_type, "MODULE") == 0 && access(kUsbInterface, F_OK) == 0;
+    live_log_answer made{.protocol = protocol, .port = port};
+    log_keep_text(made.ip, ip);
+    return made;
 }
 
-void start_on_usb()
+/* The two ends as they address each other. A tool on the LAN is told the LAN address, any other the WAN address of its
+ * family. */
+struct stream_ends {
+    stream_ends();
+
+    const log_link *const tool = log_served();
+    const char *client_ip = tool != nullptr ? tool->client_ip : "";
+    int peer_class = log_isValidIpOrUrl(client_ip); /* 1 IPv4, 2 IPv6, 0 neither */
+    char lan_ipaddr[32] = {};
+    char server_ip[64] = {}; /* the device's address that the tool can reach */
+};
+
+stream_ends::stream_ends()
 {
-    char cmd[256];
-    std::snprintf(cmd, sizeof cmd, "diag_mdlog -o /tmp/diag_logs -f %s -n 2 -s 10 -R %s -P %d &", kModemConfig,
-                  kUsbAddress, kModemPort);
-    live_log_run_modem(cmd);
-    live_log_reply({"tcp", kModemPort, kUsbAddress});
+    vex_get_nv_item("lan_ipaddr", lan_ipaddr, sizeof lan_ipaddr);
+    if (peer_class == 2) {
+        vex_get_nv_item("ipv6_wan_ipaddr", server_ip, sizeof server_ip);
+    } else {
+        char lan_netmask[32] = {};
+        vex_get_nv_item("lan_netmask", lan_netmask, sizeof lan_netmask);
+        if (ip_in_subnet(lan_ipaddr, client_ip, lan_netmask) == 1)
+            log_keep_text(server_ip, lan_ipaddr);
+        else
+            vex_get_nv_item("wan_ipaddr", server_ip, 32);
+    }
+    LOG_NOTE("server_ip is [%s]\n", server_ip);
+}
+
+/* The system log goes to the tool, line by line, and no longer to the device's own file. */
+live_log_answer start_syslog(const stream_ends &ends)
+{
+    g_daemon.syslog_realtime_on = 1;
+    log_program_change change{log_kind::syslog};
+    log_send_syslog_to_tool(change, ends.client_ip, ends.peer_class);
+    return answer("udp", kLogSyslogPort, ends.server_ip);
+}
+
+live_log_answer end_syslog()
+{
+    log_program_change change{log_kind::syslog};
+    log_end_syslog(change);
+    g_daemon.syslog_realtime_on = 0;
+    log_restart_local_syslog(change, log_read_syslog_items(32));
+    return answer("udp", 0, "");
+}
+
+/* Ends the modem's log and makes ready for a new one; the answer when that one is not to come, or has been started
+ * already. */
+std::optional<live_log_answer> prepare_modem(log_program_change &change)
+{
+    switch (log_prepare_modem(change)) {
+    case log_modem_start::no_config:
+        return live_log_answer{.result = "Fail:Modem file is not exisit"};
+    case log_modem_start::on_usb:
+        return answer("tcp", kLogModemPort, kLogModemUsbAddress);
+    case log_modem_start::ready:
+        break;
+    }
+    return std::nullopt;
+}
+
+live_log_answer start_modem(const stream_ends &ends)
+{
+    log_program_change change{log_kind::qxdm};
+    if (const auto other = prepare_modem(change))
+        return *other;
+    log_offer_modem_at(change, ends.lan_ipaddr);
+    return answer("tcp", kLogModemPort, ends.server_ip);
+}
+
+live_log_answer end_modem()
+{
+    log_program_change change{log_kind::qxdm};
+    change.settle();
+    change.end("killall -9 diag_mdlog");
+    return answer("tcp", 0, "");
+}
+
+/* Opens the data link of a stream. */
+live_log_answer open_link(log_kind kind, const live_log_request &request)
+{
+    const int port = log_text_to_int(request.port);
+    log_stream_start(kind, request.ip, port);
+    return answer("tcp", port, request.ip);
+}
+
+live_log_answer start_modem_link(const live_log_request &request)
+{
+    {
+        log_program_change change{log_kind::qxdm};
+        if (const auto other = prepare_modem(change)) {
+            if (std::strcmp(other->result, kSuccess) == 0)
+                log_stream_disown_program(log_kind::qxdm);
+            return *other;
+        }
+    }
+    return open_link(log_kind::qxdm, request);
+}
+
+live_log_answer close_link(log_kind kind)
+{
+    log_stream_end(kind);
+    return answer("tcp", 0, "");
 }
 
 } // namespace
 
-bool live_log_has_config()
+std::optional<live_log_answer> live_log_serve_tool(const live_log_request &request)
 {
-    if (access("/logfs/logconf//Diag.cfg", F_OK) == 0)
-        return true;
-    LOG_NOTE("qxdm Diag.cfg is not exisit\n");
-    return false;
+    const stream_ends ends;
+    if (request.asks("syslog", "start"))
+        return start_syslog(ends);
+    if (request.asks("syslog", "end"))
+        return end_syslog();
+    if (request.asks("qxdm", "start"))
+        return start_modem(ends);
+    if (request.asks("qxdm", "end"))
+        return end_modem();
+    return std::nullopt;
 }
 
-bool live_log_has_config2()
+std::optional<live_log_answer> live_log_serve_server(const live_log_request &request)
 {
-    return access("/logfs/logconf//Diag.cfg2", F_OK) == 0;
-}
-
-void live_log_reply(const stream_place &place, const char *result)
-{
-    log_reply("{\"msgid\":\"6\",\"realtimeLog\":{\"LogType\":\"\",\"Action\":\"\",\"protocol\":\"%s\",\"port\":\"%d\","
-              "\"ip\":\"%s\"},\"Result\":\"%s\"}",
-              place.protocol, place.port, place.ip, result);
-}
-
-void live_log_run_modem(const char *cmd)
-{
-    log_exec_cmd(cmd);
-    sleep(kModemStart);
-}
-
-bool live_log_prepare_modem()
-{
-    log_exec_cmd("killall -9 diag_mdlog");
-    log_exec_cmd("killall -9 diag_socket_log");
-    if (!live_log_has_config()) {
-        live_log_reply({"", 0, ""}, "Fail:Modem file is not exisit");
-        return false;
+    if (request.asks("syslog", "start")) {
+        g_daemon.syslog_realtime_on = 1;
+        return open_link(log_kind::syslog, request);
     }
-    if (is_usb_module()) {
-        start_on_usb();
-        return false;
-    }
-    log_exec_cmd("echo 3 > /proc/sys/vm/drop_caches &");
-    log_exec_cmd("rm /tmp/diag_logs &");
-    return true;
+    if (request.asks("syslog", "end"))
+        return close_link(log_kind::syslog);
+    if (request.asks("qxdm", "start"))
+        return start_modem_link(request);
+    if (request.asks("qxdm", "end"))
+        return close_link(log_kind::qxdm);
+    return std::nullopt;
 }

@@ -1,7 +1,6 @@
 #include "handlers/log_handler.h"
 
 #include "core/log_line.h"
-#include "core/log_registry.h"
 #include "protocol/log_json_codec.h"
 #include "protocol/log_pkg_send.h"
 
@@ -66,12 +65,6 @@ const cJSON *log_member_object(const cJSON *object, const char *name, const char
     return nullptr;
 }
 
-void log_reply_text(const char *control)
-{
-    const log_cmd_use link;
-    log_send_pkg_msg(link.fd(), link.ssl(), control, "", 0);
-}
-
 void log_reply(const char *format, ...)
 {
     char reply[kReplySize];
@@ -79,5 +72,5 @@ void log_reply(const char *format, ...)
     va_start(args, format);
     std::vsnprintf(reply, sizeof reply, format, args);
     va_end(args);
-    log_reply_text(reply);
+    log_cmd_send_msg(reply);
 }

@@ -41,10 +41,8 @@ template <std::size_t size> void log_keep_text(char (&field)[size], const char *
     field[len] = '\0';
 }
 
-/* Sends a control text on the command connection; what becomes of it is nobody's concern. */
-void log_reply_text(const char *control);
-
-/* Fills a reply template, cut at 1023 characters, and sends it. */
+/* Fills a reply template, cut at 1023 characters, and sends it on the command connection; what becomes of it is nobody's
+ * concern. */
 void log_reply(const char *format, ...) VEX_PRINTF_CHECKED(1, 2);
 
 #endif

@@ -1,11 +1,12 @@
-#include "core/log_block.h"
 #include "core/log_filemgr.h"
 #include "core/log_line.h"
-#include "core/log_registry.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
 #include "protocol/log_pkg_send.h"
+
+#include <memory>
+#include <new>
 
 namespace
 {
@@ -54,11 +55,9 @@ std::int32_t pack()
 
 bool send_piece(const char *control, log_outgoing *piece, std::int32_t len)
 {
-    for (int attempt = 0; attempt < kSendAttempts; ++attempt) {
-        const log_cmd_use link;
-        if (log_send_pkg_piece(link.fd(), link.ssl(), control, piece, len) == 0)
+    for (int attempt = 0; attempt < kSendAttempts; ++attempt)
+        if (log_cmd_send_piece(control, piece, len) == 0)
             return true;
-    }
     return false;
 }
 
@@ -70,7 +69,7 @@ void send_archive(FILE *archive, std::int32_t size, log_outgoing *piece)
                   "{\"msgid\":\"2\",\"GetLocalLog\":{\"totalLength\":\"%d\"},\"Result\":\"Success\"}", size);
     std::int32_t remaining = size;
     while (remaining > 0) {
-        const std::int32_t len = log_read_file(archive, piece->msg.data, kPieceSize);
+        const std::int32_t len = log_read_file(archive, piece->data(), kPieceSize);
         if (len == 0 || !send_piece(control, piece, len)) {
             LOG_NOTE("%s:send data fail\n", kName);
             return;
@@ -102,7 +101,7 @@ int log_msg_get_log_file(const char *control, const unsigned char *data, std::in
         reply_failure("Fail:Compressed logfs error");
         return -1;
     }
-    const auto piece = log_block_of<log_outgoing>();
+    const std::unique_ptr<log_outgoing> piece{new (std::nothrow) log_outgoing};
     FILE *archive = piece ? log_open_file(kArchive, kFileReadBinary) : nullptr;
     if (archive == nullptr) {
         reply_failure("Fail:Open log file error");

@@ -1,8 +1,9 @@
 #include "core/log_line.h"
-#include "core/log_local_syslog.h"
+#include "core/log_programs.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
+#include "protocol/log_pkg_send.h"
 
 #include <cstdio>
 #include <utility>
@@ -65,7 +66,7 @@ void reply_tree(const cJSON *root)
         return;
     char reply[kReplySize];
     std::snprintf(reply, sizeof reply, "%s", printed);
-    log_reply_text(reply);
+    log_cmd_send_msg(reply);
     cJSON_free(printed);
 }
 

@@ -1,3 +1,4 @@
+#include "core/daemon_state.h"
 #include "core/log_filemgr.h"
 #include "core/log_line.h"
 #include "core/log_tools.h"
@@ -14,10 +15,6 @@ constexpr char kConfigDir[] = "/logfs/logconf/";
 constexpr char kSetUpScript[] = "/logfs/logconf//vex_config_sys.sh";
 
 constexpr std::size_t kCmdSize = 128;
-
-/* Bytes of the package that have arrived since the last one was complete or the count was reset. It outlives the
- * connection: a tool that was cut off can go on where it stopped. 64 bits: more may arrive than was announced. */
-std::int64_t conf_recv_len;
 
 /* Answers the frame; the handler's result. */
 int reply(bool done)
@@ -53,7 +50,7 @@ void complete(FILE *package)
     log_exec_cmd("cd /logfs/logconf/ && tar -xf /logfs/logconf.tar");
     flatten();
     log_exec_cmd("rm -rf /logfs/logconf.tar");
-    conf_recv_len = 0;
+    g_daemon.conf_recv_len = 0;
     if (access(kSetUpScript, F_OK) == 0)
         log_exec_cmd("sh /logfs/logconf//vex_config_sys.sh &");
 }
@@ -69,8 +66,7 @@ bool append(const unsigned char *data, std::int32_t dataLen, int total)
     const std::int32_t written = log_write_file_full(package, data, dataLen);
     if (written < dataLen)
         LOG_NOTE("write fail,wrCount=%d,dataLen=%d\n", written, dataLen);
-    conf_recv_len += written;
-    if (total != 0 && conf_recv_len == total)
+    if ((g_daemon.conf_recv_len += written) == total && total != 0)
         complete(package);
     log_sync_file(package);
     log_close_file(package);
@@ -107,7 +103,7 @@ int log_msg_set_config_file(const char *control, const unsigned char *data, std:
         return reply(append(data, dataLen, total));
     if (total == 0) {
         pel_remove_file(kConfigDir);
-        conf_recv_len = 0;
+        g_daemon.conf_recv_len = 0;
     }
     return reply(true);
 }

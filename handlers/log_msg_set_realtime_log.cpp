@@ -42,6 +42,13 @@ bool read_request(const cJSON *tree, live_log_request *request)
     return log_type != nullptr && action != nullptr && has_server;
 }
 
+void reply(const live_log_answer &answer)
+{
+    log_reply("{\"msgid\":\"6\",\"realtimeLog\":{\"LogType\":\"\",\"Action\":\"\",\"protocol\":\"%s\",\"port\":\"%d\","
+              "\"ip\":\"%s\"},\"Result\":\"%s\"}",
+              answer.protocol, answer.port, answer.ip, answer.result);
+}
+
 } // namespace
 
 int log_msg_set_realtime_log(const char *control, const unsigned char *data, std::int32_t /*dataLen*/)
@@ -54,8 +61,10 @@ int log_msg_set_realtime_log(const char *control, const unsigned char *data, std
     log_handler_received(__func__, control);
     live_log_request request;
     if (!read_request(tree.get(), &request))
-        live_log_reply({"", 0, ""}, kInternalError);
-    else if (g_daemon.run_mode == 0 ? !live_log_serve_tool(request) : !live_log_serve_server(request))
-        log_reply_text(""); /* refused */
+        reply({.result = kInternalError});
+    else if (const auto answer = g_daemon.run_mode == 0 ? live_log_serve_tool(request) : live_log_serve_server(request))
+        reply(*answer);
+    else
+        log_reply("%s", ""); /* refused */
     return 0;
 }

@@ -1,6 +1,6 @@
 #include "core/daemon_state.h"
 #include "core/log_line.h"
-#include "core/log_local_syslog.h"
+#include "core/log_programs.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
@@ -50,7 +50,7 @@ bool read_request(const cJSON *request, syslog_para *para)
     return level != nullptr && take(para->level, level, "sysloglevel") && take(para->size, size, "syslogsize");
 }
 
-/* The local system log starts anew with the values; while it is streamed, it will when the stream ends. */
+/* The local system log is started again with the values; while it is streamed, it is when the stream ends. */
 void apply(const syslog_para &para)
 {
     if (g_daemon.syslog_realtime_on == 1) {
@@ -58,9 +58,12 @@ void apply(const syslog_para &para)
         vex_set_nv_item("syslog_size", para.size, kFieldSize);
         return;
     }
-    char path[16] = {};
-    vex_get_nv_item("syslog_path", path, sizeof path);
-    log_run_syslog_script(path, para.level, para.size, log_script_wait::no);
+    log_program_change change{log_kind::syslog};
+    log_syslog_items items;
+    vex_get_nv_item("syslog_path", items.path, 16);
+    log_keep_text(items.level, para.level);
+    log_keep_text(items.size, para.size);
+    log_restart_local_syslog(change, items);
 }
 
 void reply_stored()

@@ -1,24 +1,17 @@
 #include "protocol/log_json_codec.h"
 
+#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
 #include "core/log_tools.h"
 
 #include <algorithm>
 #include <cstring>
-#include <utility>
 
 namespace
 {
 
 constexpr char kLogSource[] = "log_json_codec";
-
-/* The control text whose handler runs on this thread, and its tree. */
-struct dispatched_text {
-    const char *control;
-    json_tree *tree;
-};
-thread_local dispatched_text t_dispatched{};
 
 /* The message id of a parsed text; -1 when the member is missing or no string. */
 int msgid_of(const cJSON *tree)
@@ -32,19 +25,17 @@ int msgid_of(const cJSON *tree)
     return log_text_to_int(msgid->valuestring);
 }
 
-/* Parses a control text. One with an escaped NUL is not taken: a text would end there for whoever reads it, and what
- * stands behind it would escape every check. */
-json_tree parse(const char *control)
+} // namespace
+
+json_tree log_json_parse(const char *control)
 {
     for (const char *at = control; (at = std::strchr(at, '\\')) != nullptr && at[1] != '\0'; at += 2)
         if (std::strncmp(at, "\\u0000", 6) == 0)
-            return {};
+            return nullptr;
     return json_tree{cJSON_Parse(control)};
 }
 
-} // namespace
-
-int log_json_get_msgid(const char *control, json_tree &tree)
+int log_json_get_msgid(const char *control)
 {
     if (control == nullptr) {
         LOG_NOTE("%s para null error\n", __func__);
@@ -54,7 +45,7 @@ int log_json_get_msgid(const char *control, json_tree &tree)
         LOG_NOTE("%s para len error\n", __func__);
         return -1;
     }
-    tree = parse(control);
+    const json_tree tree = log_json_parse(control);
     if (!tree) {
         LOG_NOTE("cJSON_Parse error\n");
         return -1;
@@ -64,18 +55,10 @@ int log_json_get_msgid(const char *control, json_tree &tree)
     return msgid;
 }
 
-json_tree log_json_parse(const char *control)
-{
-    if (t_dispatched.tree != nullptr && control == t_dispatched.control && *t_dispatched.tree)
-        return std::move(*t_dispatched.tree);
-    return parse(control);
-}
-
 int log_dl_msg_handle_cmd(const char *control, const unsigned char *data, std::int32_t dataLen)
 {
     LOG_NOTE("enter %s.\n", __func__);
-    json_tree tree;
-    const int msgid = log_json_get_msgid(control, tree);
+    const int msgid = log_json_get_msgid(control);
     if (msgid == -1) {
         LOG_NOTE("%s:error msgid=-1.\n", __func__);
         return -1;
@@ -90,13 +73,11 @@ int log_dl_msg_handle_cmd(const char *control, const unsigned char *data, std::i
         LOG_NOTE("%s,msgid %d hander is null\n", __func__, msgid);
         return 0;
     }
-    const log_cmd_turn turn{entry->beside_others};
+    const log_cmd_turn turn{g_daemon.run_mode == 0 || entry->alone};
     if (!turn.granted()) {
         LOG_NOTE("%s: another tool has taken over, command dropped\n", __func__);
         return -1;
     }
-    t_dispatched = {control, &tree};
     entry->handler(control, data, dataLen);
-    t_dispatched = {};
     return 0;
 }

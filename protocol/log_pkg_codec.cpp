@@ -15,11 +15,10 @@ bool tag_stands(const char *tag, const unsigned char *at, const unsigned char *e
     return static_cast<std::size_t>(end - at) >= kPkgTagLen && std::memcmp(at, tag, kPkgTagLen) == 0;
 }
 
-/* Bytes may already be where they belong. */
-void put(unsigned char *at, const void *bytes, std::size_t len)
+std::uint32_t get_u32(const unsigned char *at)
 {
-    if (at != bytes)
-        std::memmove(at, bytes, len);
+    return static_cast<std::uint32_t>(at[0]) << 24 | static_cast<std::uint32_t>(at[1]) << 16 |
+           static_cast<std::uint32_t>(at[2]) << 8 | static_cast<std::uint32_t>(at[3]);
 }
 
 void put_u32(unsigned char *at, std::uint32_t value)
@@ -38,34 +37,57 @@ void set_control(log_msg *msg, const void *text, std::size_t len)
         msg->control[len] = '\0';
 }
 
-/* Takes the control part, whose length stands at kPkgControlLenAt, into the record. */
-bool decode_control(const unsigned char *frame, std::size_t len, log_msg *msg)
+/* Takes the control part into the record. */
+bool decode_control(const unsigned char *frame, std::size_t len, const log_pkg_header &header, log_msg *msg)
 {
-    const std::uint32_t control_len = log_pkg_get_u32(frame + kPkgControlLenAt);
-    msg->controlLen = static_cast<std::int32_t>(control_len);
-    if (control_len > kPkgControlMax) {
+    msg->controlLen = static_cast<std::int32_t>(header.control_len);
+    if (header.control_len > kPkgControlMax) {
         LOG_NOTE("%s error control len = %d\n", "log_decode_fill_msg", msg->controlLen);
         return false;
     }
-    if (control_len + kPkgControlAt + 4 + kPkgTagLen > len) {
+    if (header.control_len + kPkgMin > len) {
         LOG_NOTE("%s error controlLen =%d\n", "log_decode_fill_msg", msg->controlLen);
         return false;
     }
-    set_control(msg, frame + kPkgControlAt, control_len);
+    set_control(msg, frame + kPkgControlAt, header.control_len);
     return true;
 }
 
-/* Takes the data part, whose length stands at `at`, into the record. */
-bool decode_data(const unsigned char *frame, std::size_t len, std::size_t at, log_msg *msg)
+/* Takes the data part, behind the control part, into the record. */
+bool decode_data(const unsigned char *frame, std::size_t len, const log_pkg_header &header, log_msg *msg)
 {
-    const std::uint32_t data_len = log_pkg_get_u32(frame + at);
-    msg->dataLen = static_cast<std::int32_t>(data_len);
-    if (data_len >= kPkgDataMax || (data_len > 0 && at + 4 + data_len + kPkgTagLen > len)) {
+    msg->dataLen = static_cast<std::int32_t>(header.data_len);
+    if (header.data_len >= kPkgDataMax || (header.data_len > 0 && header.frame_len() > len)) {
         LOG_NOTE("%s error dataLen =%d\n", "log_decode_fill_msg", msg->dataLen);
         return false;
     }
-    std::memcpy(msg->data, frame + at + 4, data_len);
+    std::memcpy(msg->data, frame + kPkgControlAt + header.control_len + 4, header.data_len);
     return true;
+}
+
+/* Whether a frame of these lengths can be encoded (logged when it cannot). */
+bool lengths_fit(std::size_t control_len, std::int32_t dataLen)
+{
+    if (control_len > kPkgControlMax) {
+        LOG_NOTE("%s: controlLen=%d error\n", "log_encode_fill_msg", static_cast<int>(control_len));
+        return false;
+    }
+    if (dataLen < 0 || dataLen > static_cast<std::int32_t>(kPkgDataMax)) {
+        LOG_NOTE("%s: dataLen=%d error\n", "log_encode_fill_msg", dataLen);
+        return false;
+    }
+    return true;
+}
+
+/* Writes what comes before the data, which ends there; then what comes behind it, with a NUL. */
+void put_around(unsigned char *data, const char *control, std::size_t control_len, std::size_t data_len)
+{
+    unsigned char *const frame = data - 4 - control_len - kPkgControlAt;
+    std::memcpy(frame, PKG_HEAD, kPkgTagLen);
+    put_u32(frame + kPkgControlLenAt, static_cast<std::uint32_t>(control_len));
+    std::memcpy(frame + kPkgControlAt, control, control_len);
+    put_u32(data - 4, static_cast<std::uint32_t>(data_len));
+    std::memcpy(data + data_len, PKG_TAIL, sizeof PKG_TAIL);
 }
 
 } // namespace
@@ -79,10 +101,17 @@ void log_msg_clear(log_msg *msg)
     std::memset(msg->tailTag, 0, sizeof msg->tailTag);
 }
 
-std::uint32_t log_pkg_get_u32(const unsigned char *at)
+log_pkg_header log_pkg_read_header(const unsigned char *frame, std::size_t held)
 {
-    return static_cast<std::uint32_t>(at[0]) << 24 | static_cast<std::uint32_t>(at[1]) << 16 |
-           static_cast<std::uint32_t>(at[2]) << 8 | static_cast<std::uint32_t>(at[3]);
+    log_pkg_header header{};
+    header.has_control_len = held > kPkgControlAt;
+    if (!header.has_control_len)
+        return header;
+    header.control_len = get_u32(frame + kPkgControlLenAt);
+    header.has_data_len = held > std::uint64_t{header.control_len} + kPkgControlAt + 4;
+    if (header.has_data_len)
+        header.data_len = get_u32(frame + kPkgControlAt + header.control_len);
+    return header;
 }
 
 const unsigned char *log_FindHead_pkg(const unsigned char *at, const unsigned char *end)
@@ -117,14 +146,11 @@ int log_decode_fill_msg(const unsigned char *frame, std::size_t len, log_msg *ms
         return 1;
     }
     std::memcpy(msg->headTag, frame, kPkgTagLen);
-    if (!decode_control(frame, len, msg))
+    const log_pkg_header header = log_pkg_read_header(frame, len);
+    if (!decode_control(frame, len, header, msg) || !decode_data(frame, len, header, msg))
         return 1;
-    std::size_t at = kPkgControlAt + static_cast<std::size_t>(msg->controlLen);
-    if (!decode_data(frame, len, at, msg))
-        return 1;
-    at += 4 + static_cast<std::size_t>(msg->dataLen);
-    std::memcpy(msg->tailTag, frame + at, kPkgTagLen);
-    at += kPkgTagLen;
+    const auto at = static_cast<std::size_t>(header.frame_len());
+    std::memcpy(msg->tailTag, frame + at - kPkgTagLen, kPkgTagLen);
     if (at != len) {
         LOG_NOTE("%s:error index %d != len %d\n", __func__, static_cast<int>(at), static_cast<int>(len));
         return 1;
@@ -159,24 +185,13 @@ int log_encode_fill_msg(const char *control, const void *data, std::int32_t data
     std::memcpy(msg->headTag, PKG_HEAD, sizeof PKG_HEAD);
     const std::size_t control_len = std::strlen(control);
     msg->controlLen = static_cast<std::int32_t>(control_len);
-    if (control_len > kPkgControlMax) {
-        LOG_NOTE("%s: controlLen=%d error\n", __func__, msg->controlLen);
-        return 1;
-    }
-    set_control(msg, control, control_len);
     msg->dataLen = dataLen;
-    if (dataLen < 0 || dataLen > static_cast<std::int32_t>(kPkgDataMax)) {
-        LOG_NOTE("%s: dataLen=%d error\n", __func__, dataLen);
+    if (!lengths_fit(control_len, dataLen))
         return 1;
-    }
-    put(msg->data, data, static_cast<std::size_t>(dataLen));
+    set_control(msg, control, control_len);
+    std::memcpy(msg->data, data, static_cast<std::size_t>(dataLen));
     std::memcpy(msg->tailTag, PKG_TAIL, sizeof PKG_TAIL);
     return 0;
-}
-
-unsigned char *log_pkg_place(log_msg *msg)
-{
-    return reinterpret_cast<unsigned char *>(msg) + offsetof(log_msg, data) - 4 - msg->controlLen - kPkgControlAt;
 }
 
 int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg *msg)
@@ -193,13 +208,20 @@ int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg 
     const auto control_len = static_cast<std::size_t>(msg->controlLen);
     const auto data_len = static_cast<std::size_t>(msg->dataLen);
     unsigned char *const data = out + kPkgControlAt + control_len + 4;
-    /* From back to front, so that the frame may overwrite the record that it is made of. */
-    put(data + data_len, PKG_TAIL, sizeof PKG_TAIL);
-    put(data, msg->data, data_len);
-    put_u32(data - 4, static_cast<std::uint32_t>(data_len));
-    put(out + kPkgControlAt, msg->control, control_len);
-    put_u32(out + kPkgControlLenAt, static_cast<std::uint32_t>(control_len));
-    put(out, PKG_HEAD, kPkgTagLen);
+    std::memcpy(data, msg->data, data_len);
+    put_around(data, msg->control, control_len, data_len);
     *sendLen = static_cast<std::int32_t>(kPkgMin + control_len + data_len);
     return 0;
+}
+
+const unsigned char *log_encode_outgoing(const char *control, std::int32_t dataLen, log_outgoing *outgoing,
+                                         std::int32_t *frame_len)
+{
+    const std::size_t control_len = std::strlen(control);
+    if (!lengths_fit(control_len, dataLen))
+        return nullptr;
+    LOG_NOTE("%s enter\n", "log_encode_pkg_buf");
+    put_around(outgoing->data(), control, control_len, static_cast<std::size_t>(dataLen));
+    *frame_len = static_cast<std::int32_t>(kPkgMin + control_len) + dataLen;
+    return outgoing->data() - 4 - control_len - kPkgControlAt;
 }

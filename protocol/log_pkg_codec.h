@@ -51,8 +51,19 @@ static_assert(kPkgMax == 63500 && kPkgEncodeMin == 63504);
  */
 void log_msg_clear(log_msg *msg);
 
-/* The 32-bit big-endian number at `at`. */
-std::uint32_t log_pkg_get_u32(const unsigned char *at);
+/* What the first bytes of a frame tell of its lengths, which are as the peer gave them and can be any. */
+struct log_pkg_header {
+    bool has_control_len; /* enough bytes are held for it, here and below */
+    bool has_data_len;
+    std::uint32_t control_len;
+    std::uint32_t data_len;
+
+    /* Of the whole frame: 64 bits, as the sum must not wrap. */
+    std::uint64_t frame_len() const { return std::uint64_t{kPkgMin} + control_len + data_len; }
+};
+
+/* Reads what can be told of a frame by the `held` bytes at its start, whatever its head tag is. */
+log_pkg_header log_pkg_read_header(const unsigned char *frame, std::size_t held);
 
 /* `at` when the head tag (the tail tag) stands there, whole and before `end`; else null. They do not search. */
 const unsigned char *log_FindHead_pkg(const unsigned char *at, const unsigned char *end);
@@ -68,16 +79,28 @@ int log_decode_msg(const unsigned char *frame, std::size_t len, log_msg *msg);
 
 /*
  * Fills a cleared record with a control text, up to its NUL, and `dataLen` bytes of data. `data` is never
- * null, also where there is none; it may be the record's own `data`. 0 filled, 1 refused.
+ * null, also where there is none. 0 filled, 1 refused.
  */
 int log_encode_fill_msg(const char *control, const void *data, std::int32_t dataLen, log_msg *msg);
 
-/* Where in a filled record its own frame may be written, so that the data need not be moved. */
-unsigned char *log_pkg_place(log_msg *msg);
-
-/* Writes the record's frame, and a NUL behind it, to `out`: a buffer of its own, or log_pkg_place(), and then only
- * the record's data is left of it. `*sendLen` holds the capacity of `out`, at least kPkgEncodeMin, and then the
- * frame's length. 0 encoded; 1 refused, `*sendLen` is then as it was. */
+/* Writes the record's frame, and a NUL behind it, to `out`. `*sendLen` holds the capacity of `out`, at least
+ * kPkgEncodeMin, and then the frame's length. 0 encoded; 1 refused, `*sendLen` is then as it was. */
 int log_encode_pkg_buf(unsigned char *out, std::int32_t *sendLen, const log_msg *msg);
+
+constexpr std::size_t kPkgHeadRoom = 2112; /* what comes before the data fits in; the data is aligned to 64 */
+
+/* A frame that is sent from where its data lies. */
+struct alignas(64) log_outgoing {
+    unsigned char *data() { return bytes + kPkgHeadRoom; } /* what comes before it ends there */
+
+    unsigned char bytes[kPkgSendBuf];
+};
+static_assert(kPkgHeadRoom >= kPkgControlAt + kPkgControlMax + 4);
+static_assert(kPkgSendBuf >= kPkgHeadRoom + kPkgDataMax + sizeof PKG_TAIL);
+
+/* Completes the frame of a control text and of the `dataLen` bytes that are at `outgoing->data()` already. Its first
+ * byte, and its length in `*frame_len`; null, and nothing is changed, when it is refused. */
+const unsigned char *log_encode_outgoing(const char *control, std::int32_t dataLen, log_outgoing *outgoing,
+                                         std::int32_t *frame_len);
 
 #endif

@@ -5,6 +5,7 @@
 
 #include <cstddef>
 #include <cstring>
+#include <new>
 #include <optional>
 
 namespace
@@ -12,12 +13,6 @@ namespace
 
 constexpr char kLogSource[] = "vex_log_manage";
 constexpr char kName[] = "log_proc_tcp_pkg"; /* the routine that the log lines speak of */
-
-/* Bytes that are read straight into the buffer may go beyond its end for a moment. */
-unsigned char *end_of_held(log_incoming &incoming, std::size_t len)
-{
-    return reinterpret_cast<unsigned char *>(&incoming) + offsetof(log_incoming, recv_pkg_buf) + len;
-}
 
 void append(log_reassembly &state, std::span<const unsigned char> piece)
 {
@@ -27,34 +22,26 @@ void append(log_reassembly &state, std::span<const unsigned char> piece)
     }
     if (piece.size() >= LOG_RECV_PKG_LEN)
         return;
-    unsigned char *const at = end_of_held(*state.incoming, state.recv_pkg_len);
-    if (at != piece.data())
-        std::memmove(at, piece.data(), piece.size());
+    std::memcpy(state.incoming->recv_pkg_buf + state.recv_pkg_len, piece.data(), piece.size());
     state.recv_pkg_len += piece.size();
 }
 
 /* Length of the frame at the start of the held bytes, once it is known and held whole. */
 std::optional<std::size_t> whole_frame(const log_reassembly &state, std::size_t piece_len)
 {
-    const unsigned char *held = state.incoming->recv_pkg_buf;
-    if (state.recv_pkg_len <= kPkgControlAt) {
+    const log_pkg_header header = log_pkg_read_header(state.incoming->recv_pkg_buf, state.recv_pkg_len);
+    if (!header.has_control_len) {
         LOG_FAULT("%s: recv data too small=%d", kName, static_cast<int>(piece_len));
         return std::nullopt;
     }
-    /* 64 bits: a sum with a length of the peer's must not wrap where size_t has 32. */
-    const std::uint64_t control_len = log_pkg_get_u32(held + kPkgControlLenAt);
-    LOG_NOTE("%s: controlLen =%d", kName, static_cast<int>(control_len));
-    if (state.recv_pkg_len <= control_len + kPkgControlAt + 4) {
+    LOG_NOTE("%s: controlLen =%d", kName, static_cast<int>(header.control_len));
+    if (header.has_data_len)
+        LOG_NOTE("%s: dataLen =%d", kName, static_cast<int>(header.data_len));
+    if (!header.has_data_len || state.recv_pkg_len < header.frame_len()) {
         LOG_NOTE("%s: continue recv data, Received =%d", kName, static_cast<int>(state.recv_pkg_len));
         return std::nullopt;
     }
-    const std::uint64_t data_len = log_pkg_get_u32(held + kPkgControlAt + control_len);
-    LOG_NOTE("%s: dataLen =%d", kName, static_cast<int>(data_len));
-    if (state.recv_pkg_len < control_len + data_len + kPkgMin) {
-        LOG_NOTE("%s: continue recv data, Received =%d", kName, static_cast<int>(state.recv_pkg_len));
-        return std::nullopt;
-    }
-    return static_cast<std::size_t>(control_len + data_len + kPkgMin);
+    return static_cast<std::size_t>(header.frame_len());
 }
 
 /* Decodes the frame at the start of the held bytes and runs its command. */
@@ -87,16 +74,11 @@ void drop_frame(log_reassembly &state, std::size_t len)
 
 } // namespace
 
-unsigned char *log_reassembly_room(log_reassembly &state)
-{
-    return state.incoming ? end_of_held(*state.incoming, state.recv_pkg_len) : nullptr;
-}
-
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece)
 {
     LOG_NOTE("enter %s len = [%d]\n", __func__, static_cast<int>(piece.size()));
     if (!state.incoming)
-        state.incoming = log_block_of<log_incoming>();
+        state.incoming.reset(new (std::nothrow) log_incoming);
     if (!state.incoming) {
         LOG_NOTE("LOG_RECV_PKG_LEN malloc failed.\n");
         return -1;

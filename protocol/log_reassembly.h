@@ -9,36 +9,30 @@
 #ifndef PROTOCOL_LOG_REASSEMBLY_H
 #define PROTOCOL_LOG_REASSEMBLY_H
 
-#include "core/log_block.h"
 #include "protocol/log_pkg_codec.h"
 
 #include <cstddef>
+#include <memory>
 #include <span>
 
 constexpr std::size_t LOG_RECV_PKG_LEN = 61440; /* bytes; held bytes are always fewer */
-constexpr std::size_t kLogPieceMax = 2000;      /* bytes per read of a connection */
 
 /* What a frame on its way in takes up. Nothing behind the held bytes is ever read. */
 struct log_incoming {
     log_msg msg; /* the frame that is being handled */
     unsigned char recv_pkg_buf[LOG_RECV_PKG_LEN];
-    unsigned char piece[kLogPieceMax]; /* so that a piece always fits behind the held bytes */
 };
 
 /* One connection's bytes that are not yet a frame. Lives and ends with the connection; one thread feeds it. */
 struct log_reassembly {
-    log_block_ptr<log_incoming> incoming; /* allocated by the first piece */
-    std::size_t recv_pkg_len = 0;         /* bytes held, from offset 0 */
+    std::unique_ptr<log_incoming> incoming; /* allocated by the first piece */
+    std::size_t recv_pkg_len = 0;           /* bytes held, from offset 0 */
 };
 
-/* Where the next piece of up to kLogPieceMax bytes may be read to, so that it need not be moved: behind the held bytes.
- * Null before the first piece. */
-unsigned char *log_reassembly_room(log_reassembly &state);
-
 /*
- * Appends a piece, from log_reassembly_room() or from anywhere else, and handles every whole frame, in order, on the
- * calling thread; a rest is kept for the next piece. A frame that cannot be decoded is dropped by itself. 0; -1 only
- * when the buffer cannot be allocated: the piece is lost. Logs at level 6 as "vex_log_manage".
+ * Appends a piece and handles every whole frame, in order, on the calling thread; a rest is kept for the next piece. A
+ * frame that cannot be decoded is dropped by itself. 0; -1 only when the buffer cannot be allocated: the piece is lost.
+ * Logs at level 6 as "vex_log_manage".
  */
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece);
 

@@ -1,15 +1,9 @@
 #include "protocol/log_recv.h"
 
-#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
-#include "protocol/log_reassembly.h"
 
-#include <cerrno>
-#include <cstdint>
 #include <cstring>
-#include <sys/socket.h>
-#include <unistd.h>
 
 namespace
 {
@@ -17,34 +11,17 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 constexpr char kName[] = "log_recv_tcp_msg"; /* the routine that the log lines speak of */
 
-constexpr useconds_t kInterruptedPause = 20000; /* microseconds */
-
-/* Serves the connection for as long as it lives, and closes it whichever way its thread ends. */
-struct cmd_owner {
-    explicit cmd_owner(int connection) : fd(connection) { log_cmd_serve(fd); }
-    ~cmd_owner() { log_cmd_close(fd); }
-    cmd_owner(const cmd_owner &) = delete;
-    cmd_owner &operator=(const cmd_owner &) = delete;
-    const int fd;
-};
-
-/* The blocking read, the one place where the thread can be cancelled. Nobody cancels one that reads a TLS session. */
-ssize_t read_piece(int fd, unsigned char *piece)
+void take_piece(log_link & /*link*/, log_reassembly &state, std::span<const unsigned char> piece)
 {
-    if (g_daemon.use_ssl == 1) {
-        SSL *const session = log_cmd_session();
-        return session != nullptr ? g_daemon.ssl_read(session, piece, kLogPieceMax) : 0;
-    }
-    pthread_setcancelstate(PTHREAD_CANCEL_ENABLE, nullptr);
-    const ssize_t n = recv(fd, piece, kLogPieceMax, 0);
-    pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
-    return n;
+    LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(piece.size()));
+    log_proc_tcp_pkg(state, piece);
+    LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
 }
 
 /* Logs why the peer's bytes have ended: an error, or 0. One that was replaced did not end them. */
-void log_end(int error)
+void log_end(const log_link &link, int error)
 {
-    if (!log_cmd_stands())
+    if (link.taken)
         return;
     if (error != 0)
         LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(error));
@@ -52,45 +29,27 @@ void log_end(int error)
         LOG_NOTE("%s:recvcount=0,client close\n", kName);
 }
 
-/* Reads and handles pieces until the connection has ended. */
-void receive(int fd)
-{
-    log_reassembly state;
-    unsigned char first[kLogPieceMax];
-    for (;;) {
-        unsigned char *const room = log_reassembly_room(state);
-        unsigned char *const piece = room != nullptr ? room : first;
-        const ssize_t n = read_piece(fd, piece);
-        if (n == -1 && errno == EINTR) {
-            usleep(kInterruptedPause);
-            continue;
-        }
-        if (n <= 0) {
-            log_end(n == -1 ? errno : 0);
-            return;
-        }
-        LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(n));
-        log_proc_tcp_pkg(state, {piece, static_cast<std::size_t>(n)});
-        LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
-    }
-}
-
 } // namespace
 
-void *log_recv_argument(int fd)
+int log_recv_link(log_link &link, log_take_piece take)
 {
-    return reinterpret_cast<void *>(static_cast<std::intptr_t>(fd));
+    log_reassembly state;
+    unsigned char piece[kLogPieceMax];
+    return log_read_pieces([&] { return link.read(piece, sizeof piece); },
+                           [&](std::size_t len) {
+                               take(link, state, {piece, len});
+                           });
 }
 
-void *log_recv_tcp_msg(void *connection)
+void log_recv_tcp_msg(log_link &link, void (*close)(log_link &link))
 {
-    pthread_setcancelstate(PTHREAD_CANCEL_DISABLE, nullptr);
-    const int fd = static_cast<int>(reinterpret_cast<std::intptr_t>(connection));
+    const int fd = link.fd.get();
     {
-        const cmd_owner owner{fd};
+        const log_serving serving{link};
         LOG_NOTE("enter %s: fd=[%d]\n", __func__, fd);
-        receive(fd);
+        log_end(link, log_recv_link(link, take_piece));
+        log_cmd_forget(link);
+        close(link);
     }
     LOG_NOTE("exit %s: fd=[%d]\n", __func__, fd);
-    return nullptr;
 }

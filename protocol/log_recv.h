@@ -1,18 +1,24 @@
-/* The receive loop of the command connection. */
+/* The receive loops: how the bytes of a link become commands. */
 #ifndef PROTOCOL_LOG_RECV_H
 #define PROTOCOL_LOG_RECV_H
 
-/* Makes a descriptor the argument of log_recv_tcp_msg() as a thread body. */
-void *log_recv_argument(int fd);
+#include "core/log_link.h"
+#include "protocol/log_reassembly.h"
+
+#include <span>
+
+/* Has the frames in a piece carried out, and logs it. */
+using log_take_piece = void (*)(log_link &link, log_reassembly &state, std::span<const unsigned char> piece);
+
+/* Reads the link, which the calling thread owns and serves, and hands over its pieces until it ends or was taken away:
+ * then 0, or the errno of the read that failed. */
+int log_recv_link(log_link &link, log_take_piece take);
 
 /*
- * Owns the command connection whose descriptor is the argument: reads it and has its commands carried out
- * until the peer closes, a read fails, or the thread is cancelled because another connection took its place;
- * then closes it and takes it out of the registry. Returns null.
- *
- * Cancellation works by unwinding the stack, which ends the process where it meets a destructor or a noexcept
- * procedure. So the thread can be cancelled in its blocking read and nowhere else.
+ * Owns the command connection: reads it and has its commands carried out until the peer closes, a read fails, or
+ * another connection takes it over; then takes it out of the registry and has `close` end it, which is given no owner
+ * any more. Logs at level 6 as "vex_log_manage".
  */
-void *log_recv_tcp_msg(void *connection);
+void log_recv_tcp_msg(log_link &link, void (*close)(log_link &link));
 
 #endif

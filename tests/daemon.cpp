@@ -3,7 +3,6 @@
 #include "tests/frame.h"
 
 #include <algorithm>
-#include <arpa/inet.h>
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
@@ -33,14 +32,6 @@ std::string receive_all(int fd, std::size_t count)
     std::string out(count, '\0');
     out.resize(count == 0 || recv(fd, out.data(), count, MSG_WAITALL) == static_cast<ssize_t>(count) ? count : 0);
     return out;
-}
-
-/* The length that is held there; 0 without one. */
-std::size_t length_at(const std::string &bytes, std::size_t at)
-{
-    std::uint32_t n = 0;
-    bytes.copy(reinterpret_cast<char *>(&n), sizeof n, std::min(at, bytes.size()));
-    return ntohl(n);
 }
 
 } // namespace
@@ -77,9 +68,9 @@ void tool_connection::send(const std::string &bytes) const
 std::string tool_connection::receive(std::string *data) const
 {
     const std::string head = receive_all(fd.get(), 6);
-    const std::string control = receive_all(fd.get(), length_at(head, 2));
+    const std::string control = receive_all(fd.get(), head.empty() ? 0 : number_at(head, 2));
     const std::string length = receive_all(fd.get(), 4);
-    const std::string rest = receive_all(fd.get(), length_at(length, 0) + 2);
+    const std::string rest = receive_all(fd.get(), number_at(length, 0) + 2);
     if (rest.empty())
         return "(closed)";
     if (data != nullptr)

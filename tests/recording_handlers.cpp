@@ -2,6 +2,7 @@
 
 #include "protocol/log_json_codec.h"
 
+#include <array>
 #include <utility>
 
 std::string g_commands;
@@ -21,6 +22,8 @@ template <int... n> std::array<log_msg_handler_entry, 11> all(std::integer_seque
     return {{{n + 1, n == 8 ? nullptr : record<n + 1>}...}};
 }
 
+const auto kTable = all(std::make_integer_sequence<int, 11>());
+
 } // namespace
 
-const std::array<log_msg_handler_entry, 11> log_msg_handler_table = all(std::make_integer_sequence<int, 11>());
+const std::span<const log_msg_handler_entry> log_msg_handler_table{kTable};

@@ -22,7 +22,7 @@ protected:
         int ends[2];
         ASSERT_EQ(0, socketpair(AF_UNIX, SOCK_STREAM, 0, ends));
         peer_.reset(ends[1]);
-        log_cmd_record_link(ends[0]);
+        log_cmd_record(std::make_shared<log_link>(unique_fd{ends[0]}, nullptr));
         g_platform = {};
     }
     static int hand(int msgid, const char *control)

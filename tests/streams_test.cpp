@@ -4,8 +4,11 @@
 #include "tools/tool_process.h"
 
 #include <atomic>
+#include <chrono>
 #include <fstream>
 #include <future>
+#include <netinet/in.h>
+#include <openssl/err.h>
 #include <random>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -24,6 +27,15 @@ struct stream {
 };
 constexpr stream kSyslog{"syslog", "syslog_connect"};
 constexpr stream kModem{"qxdm", "modemlog_connect"};
+
+/* How a device ends a link. */
+enum class link_end {
+    good_bye, /* TLS: close_notify, then the end of the connection */
+    bare,     /* the end of the connection by itself, which is all there is without TLS */
+    alert,    /* TLS: a fatal alert */
+    reset,
+    none, /* within kPatience */
+};
 
 /* This test is the log server; the device's log programs write a file that it knows. */
 class Streams : public testing::Test
@@ -142,15 +154,46 @@ protected:
             short wanted = POLLIN;
             const ssize_t n = tool_read_some(link, {piece, std::min(sizeof piece, count - got)}, wanted);
             for (ssize_t i = 0; i < n; ++i)
-                equal = equal && static_cast<char>(piece[i]) == feed_[got++ % feed_.size()];
+                equal = static_cast<char>(piece[i]) == feed_[got++ % feed_.size()] && equal;
             pollfd entry{link.fd.get(), wanted, 0};
             if (n == 0 || (n < 0 && errno != EAGAIN) || (n < 0 && poll(&entry, 1, kPatience) != 1))
                 break;
         }
         return {equal, got};
     }
-    /* Waits for the device to end a link. */
-    bool ended(tool_link &link) const { return take(link, SIZE_MAX).second < SIZE_MAX; }
+    /* Takes what comes until the device ends the link; how it does. `pause` after each 16 kB: a slow server. */
+    static link_end end_of(tool_link &link, std::chrono::microseconds pause = {})
+    {
+        unsigned char piece[16384];
+        for (;;) {
+            short wanted = POLLIN;
+            const ssize_t n = tool_read_some(link, piece, wanted);
+            pollfd entry{link.fd.get(), wanted, 0};
+            if (n > 0)
+                std::this_thread::sleep_for(pause);
+            else if (n == 0 || errno != EAGAIN)
+                return kind_of_end(link, n);
+            else if (poll(&entry, 1, kPatience) != 1)
+                return link_end::none;
+        }
+    }
+    static link_end kind_of_end(const tool_link &link, ssize_t n)
+    {
+        if (link.session == nullptr)
+            return n == 0 ? link_end::bare : link_end::reset;
+        const unsigned long error = ERR_peek_last_error();
+        if (n == 0)
+            return link_end::good_bye;
+        if (error == 0)
+            return link_end::reset;
+        return ERR_GET_REASON(error) == SSL_R_UNEXPECTED_EOF_WHILE_READING ? link_end::bare : link_end::alert;
+    }
+    /* What a stream's end is that both sides have agreed on. */
+    static link_end clean(const tool_link &link)
+    {
+        return link.session != nullptr ? link_end::good_bye : link_end::bare;
+    }
+    static bool ends_clean(tool_link &link) { return end_of(link) == clean(link); }
     /* The device's daemon ends with its server. */
     void hang_up()
     {
@@ -195,7 +238,7 @@ TEST_F(Streams, BringEveryByteWhileCommandsAreAnswered)
             EXPECT_NE(std::string::npos, commands.find(line)) << line << commands;
         end(kSyslog);
         end(kModem);
-        EXPECT_TRUE(ended(links[0]) && ended(links[1]));
+        EXPECT_TRUE(ends_clean(links[0]) && ends_clean(links[1]));
         hang_up();
     }
 }
@@ -255,7 +298,10 @@ TEST_F(Streams, EndAtAnyMoment)
             end(kSyslog);
             end(kModem);
             memory = i == 9 ? daemon_->memory() : memory;
-            EXPECT_TRUE((!links[0] || ended(*links[0])) && (!links[1] || ended(*links[1])));
+            for (std::optional<tool_link> &link : links) {
+                const link_end how = link ? end_of(*link) : link_end::bare;
+                EXPECT_TRUE(how != link_end::alert && how != link_end::none) << static_cast<int>(how);
+            }
         }
         EXPECT_TRUE(daemon_->settles(rest)) << run_command("ls -l " + daemon_->proc("fd"));
         EXPECT_TRUE(!kMemoryIsOurs || daemon_->memory() <= memory + 200) << daemon_->memory() - memory;
@@ -281,7 +327,6 @@ TEST_F(Streams, MayFailToBegin)
              {{.call = kFaultSocket, .only = AF_UNIX}, "can not create socket. errno: 24", true},
              {{.call = kFaultBind, .only = AF_UNIX}, "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
              {{.call = kFaultListen, .only = AF_UNIX}, "can not listen socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
-             {{.call = kFaultAccept, .only = AF_UNIX}, "can not accept client, errno: 24", true},
              {{.call = kFaultSocket, .only = AF_INET}, "Error calling socket: Too many open files, errno: 24", false},
          }) {
         daemon_->commands();
@@ -290,13 +335,21 @@ TEST_F(Streams, MayFailToBegin)
         EXPECT_TRUE(daemon_->logs(words));
         if (calls) {
             tool_link link = accept_link(kSyslog, listener_);
-            EXPECT_TRUE(daemon_->settles({rest.first + 1, rest.second + 1})) << words;
+            EXPECT_TRUE(daemon_->settles({rest.first + 2, rest.second + 1})) << words; /* a socket and an event */
             confirm(link, kSyslog); /* its program would have nowhere to write to */
             EXPECT_TRUE(daemon_->logs("can not connect to:/tmp/MSG_ID_SYSLOG, errno: ", ++refused));
             EXPECT_EQ("", daemon_->commands());
         }
         end(kSyslog);
         EXPECT_TRUE(daemon_->settles(rest)) << words;
+    }
+    {
+        tool_link link = start(kSyslog);
+        let_fail({.call = kFaultAccept, .only = AF_UNIX});
+        confirm(link, kSyslog);
+        EXPECT_TRUE(daemon_->logs("can not accept client, errno: 24"));
+        end(kSyslog);
+        EXPECT_TRUE(daemon_->settles(rest));
     }
     order(kSyslog, "5003");
     EXPECT_TRUE(daemon_->logs("fail connect to address: 127.0.0.1, port number: 5003"));
@@ -341,7 +394,7 @@ TEST_F(Streams, AreNotBegunWithoutWhatTheirProgramsNeed)
     EXPECT_TRUE(daemon_->logs("qxdm Diag.cfg is not exisit"));
     EXPECT_EQ("killall -9 diag_mdlog\n", daemon_->commands());
     run_command("touch /logfs/logconf/Diag.cfg");
-    let_fail({.call = kFaultFork});
+    let_fail({.call = kFaultSpawn, .pass = 3});
     confirm(links[1], kModem);
     EXPECT_TRUE(daemon_->logs("&] System error1")) << "the program could not be started";
     confirm(links[0], kSyslog); /* no syslogd is there to be killed */
@@ -427,13 +480,188 @@ TEST_F(Streams, EndTheirLinksWithTheirErrors)
     }
     {
         const tool_link link = start(kSyslog);
-        let_fail({.call = kFaultFork});
+        let_fail({.call = kFaultSpawn});
     }
     EXPECT_TRUE(daemon_->logs("log_recv_server_msg:recvcount=0,client close fd["));
     EXPECT_TRUE(daemon_->logs("vex_syslog.sh -L -o /logfs -l 7 -s 512 &] System error1"));
     EXPECT_TRUE(daemon_->settles(rest));
     EXPECT_EQ(kOnline, ask(kAskMode));
     hang_up();
+}
+
+/* A stop, or a newer start, waits for what is on its way, then says good-bye: also to a server that reads slowly. */
+TEST_F(Streams, AreEndedWithAGoodBye)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 100000);
+        for (const stream &which : {kSyslog, kModem}) {
+            tool_link idle = start(which);
+            end(which);
+            EXPECT_TRUE(ends_clean(idle));
+            tool_link busy = start(which);
+            confirm(busy, which);
+            EXPECT_TRUE(take(busy, 4000000).first);
+            const bool slow = tls; /* without TLS the kernel sends what is left, however long that takes */
+            auto busy_end = std::async(
+                std::launch::async, [&busy, slow] { return end_of(busy, std::chrono::microseconds(slow ? 4000 : 0)); });
+            end(which);
+            EXPECT_EQ(clean(busy), busy_end.get());
+            tool_link older = start(which);
+            confirm(older, which);
+            EXPECT_TRUE(take(older, 4000000).first);
+            auto older_end = std::async(std::launch::async, [&older] { return end_of(older); });
+            tool_link newer = start(which);
+            EXPECT_EQ(clean(older), older_end.get());
+            confirm(newer, which);
+            EXPECT_TRUE(take(newer, 4000000).first);
+            end(which);
+            EXPECT_TRUE(ends_clean(newer));
+        }
+        hang_up();
+    }
+}
+
+/* The device's daemon ends with its server: its links are closed like any other, and the device logs locally again. */
+TEST_F(Streams, AreEndedWithTheDaemon)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 100000);
+        tool_link links[] = {start(kSyslog), start(kModem)};
+        confirm(links[0], kSyslog);
+        confirm(links[1], kModem);
+        EXPECT_TRUE(take(links[0], 100000).first && take(links[1], 100000).first);
+        daemon_->commands();
+        std::future<bool> ends[2];
+        for (std::size_t i = 0; i < 2; ++i)
+            ends[i] = std::async(std::launch::async, [&link = links[i]] { return ends_clean(link); });
+        control_.reset();
+        EXPECT_EQ(0, daemon_->wait_exit());
+        EXPECT_TRUE(ends[0].get());
+        EXPECT_TRUE(ends[1].get());
+        const std::string commands = daemon_->commands();
+        for (const char *line : {"killall -9 syslogd\n", "diag_mdlog -k\n",
+                                 "sh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o /logfs -l 7 -s 512 &\n"})
+            EXPECT_NE(std::string::npos, commands.find(line)) << line << commands;
+        daemon_.reset();
+        listener_.fd.reset();
+    }
+}
+
+TEST_F(Streams, AreNotHeldUpByAProgramThatHangs)
+{
+    call(true, 1000);
+    run_command("mkfifo /tmp/go /tmp/runs; mkdir /tmp/f; cp " FEEDER " /tmp/f/diag_mdlog");
+    install_program("diag_mdlog", "[ $1 = -k ] && read go </tmp/go\nexec /tmp/f/diag_mdlog \"$@\"");
+    start(kModem); /* the server closes the link, and the command for its end hangs */
+    EXPECT_TRUE(daemon_->logs("cmdStr[diag_mdlog -k ]"));
+    {
+        tool_link link = start(kModem);
+        confirm(link, kModem);
+        EXPECT_EQ(std::pair(true, feed_.size()), take(link, feed_.size()));
+        EXPECT_EQ(kOnline, ask(kAskMode));
+        /* A command that hangs on a data link holds up neither the control link nor the end of the daemon. */
+        install_program("df", "echo runs >/tmp/runs; read go </tmp/go");
+        std::string why;
+        EXPECT_TRUE(tool_send(link, R"({"msgid":"3"})", {}, why));
+        EXPECT_EQ("runs\n", read_file("/tmp/runs"));
+        EXPECT_EQ(kOnline, ask(kAskMode));
+    }
+    hang_up();
+}
+
+/* A program of the script that restarts the local log is its own; and a restart is not overtaken by the one before. */
+TEST_F(Streams, LeaveTheLatestLocalLogBehind)
+{
+    run_command("mkfifo /tmp/never; mkdir /tmp/f; cp " FEEDER " /tmp/f/syslogd");
+    install_program("klogd", "read go </tmp/never");
+    install_program("killall", "[ $1 = -q ] && { sleep 0.1; klogd & }\nexec /usr/vex/bin/killall \"$@\"");
+    install_program("syslogd", "[ $1 = -O ] && read go </tmp/never\nexec /tmp/f/syslogd \"$@\"");
+    call(false, 0);
+    for (int i = 0; i < 8; ++i) {
+        const std::string level = std::to_string(1 + i % 7);
+        tool_link link = start(kSyslog);
+        confirm(link, kSyslog);
+        end(kSyslog);
+        EXPECT_EQ(R"({"msgid":"4","syslogParaSet":{"sysloglevel":")" + level +
+                      R"(","syslogsize":"64"},"Result":"Success"})",
+                  ask(R"({"msgid":"4","syslogParaSet":{"sysloglevel":")" + level + R"(","syslogsize":"64"}})"));
+        EXPECT_TRUE(ends_clean(link));
+        EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg", i + 1));
+        run_command("while busybox ps -o args | grep -q '[v]ex_syslog.sh'; do sleep 0.01; done");
+        EXPECT_EQ("{syslogd} /bin/sh /usr/vex/override/syslogd -O /logfs/syslog -l " + level + " -s 64\n",
+                  run_command("busybox ps -o args | grep '[o]verride/syslogd'"));
+        EXPECT_EQ("", run_command("timeout 10 sh -c 'until [ $(busybox pidof klogd | wc -w) = " +
+                                  std::to_string(2 * i + 2) + " ]; do sleep 0.01; done' || echo ended"))
+            << "what a script has started lives on";
+    }
+    hang_up();
+}
+
+/* A link that is being connected, or is shaking hands, ends with its stop. */
+TEST_F(Streams, AreStoppedBeforeTheyAreConnected)
+{
+    call(true, 0);
+    const resources rest = daemon_->used();
+    const unique_fd full{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)}; /* its backlog is: nobody is answered */
+    sockaddr_in at{};
+    at.sin_family = AF_INET;
+    at.sin_port = htons(5003);
+    at.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    ASSERT_EQ(0, bind(full.get(), reinterpret_cast<sockaddr *>(&at), sizeof at));
+    ASSERT_EQ(0, listen(full.get(), 0));
+    const unique_fd first{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
+    ASSERT_EQ(0, connect(first.get(), reinterpret_cast<sockaddr *>(&at), sizeof at));
+    const tool_listener silent = listen_at("5004");
+    for (long i = 1; i <= 10; ++i) {
+        order(kSyslog, "5003");
+        order(kModem, "5004");
+        EXPECT_TRUE(daemon_->logs("Trying to connect to address: 127.0.0.1, port: 5003", i));
+        const unique_fd never_answered = accept_bare(silent);
+        end(kSyslog);
+        end(kModem);
+        EXPECT_TRUE(daemon_->settles(rest)) << i;
+    }
+    hang_up();
+}
+
+TEST_F(Streams, AreConfirmedOnce)
+{
+    call(true, 100000);
+    tool_link link = start(kSyslog);
+    confirm(link, kSyslog);
+    confirm(link, kSyslog);
+    EXPECT_TRUE(daemon_->logs("the data link has been confirmed before and its program writes, refused"));
+    const std::size_t more_than_waited = std::size_t{50} << 20;
+    EXPECT_EQ(std::pair(true, more_than_waited), take(link, more_than_waited));
+    end(kSyslog);
+    tool_link modem = start(kModem);
+    confirm(modem, kModem);
+    EXPECT_TRUE(take(modem, 100000).first);
+    run_command("rm /logfs/logconf/Diag.cfg");
+    EXPECT_NE(std::string::npos, ask(kModem, "start").find("Fail:Modem file is not exisit"));
+    daemon_->commands();
+    {
+        const tool_link gone = std::move(modem);
+    }
+    EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg", 2));
+    EXPECT_EQ("diag_mdlog -k \n", daemon_->commands()) << "the older link's program is still its own";
+    hang_up();
+}
+
+/* What has arrived is carried out although no reply can be sent. */
+TEST_F(Streams, RunCommandsWhoseRepliesAreLost)
+{
+    ASSERT_TRUE(prepare_faults());
+    for (const bool tls : {false, true}) {
+        call(tls, 0);
+        const int count = 50;
+        std::string why;
+        let_fail({.call = kFaultSend, .only = 5000});
+        for (int i = 0; i < count; ++i)
+            EXPECT_TRUE(tool_send(*control_, R"({"msgid":"11","mode_lpm_online":"lpm"})", {}, why));
+        EXPECT_TRUE(daemon_->logs("modem mode = lpm", count)) << tls;
+        hang_up();
+    }
 }
 
 } // namespace

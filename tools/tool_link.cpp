@@ -83,18 +83,10 @@ std::optional<std::size_t> frame_length(const std::vector<unsigned char> &held)
     if (!std::equal(held.begin(), held.begin() + static_cast<std::ptrdiff_t>(std::min(held.size(), kPkgTagLen)),
                     PKG_HEAD))
         return std::nullopt;
-    if (held.size() < kPkgMin)
-        return 0;
-    const std::uint32_t control_len = log_pkg_get_u32(held.data() + kPkgControlLenAt);
-    if (control_len > kPkgControlMax)
+    const log_pkg_header header = log_pkg_read_header(held.data(), held.size());
+    if (header.control_len > kPkgControlMax || header.data_len >= kPkgDataMax)
         return std::nullopt;
-    const std::size_t data_len_at = kPkgControlAt + control_len;
-    if (held.size() < data_len_at + 4)
-        return 0;
-    const std::uint32_t data_len = log_pkg_get_u32(held.data() + data_len_at);
-    if (data_len >= kPkgDataMax)
-        return std::nullopt;
-    return kPkgMin + control_len + data_len;
+    return header.has_data_len ? static_cast<std::size_t>(header.frame_len()) : 0;
 }
 
 /* Takes the frame of `len` bytes off the held bytes. */

@@ -2,10 +2,10 @@
  * Server mode's front door: two threads, one for IPv4 and one for IPv6, that listen on TCP port 48888 and
  * hand each log tool to a receive thread of its own. There is one command connection: the newest tool has it.
  *
- *     listener (IPv4) --+                        take the old connection away
- *                       +--> accept, then, as    record the new one
- *     listener (IPv6) --+    one step under      cancel the old receive thread
- *                            g_takeover_lock:    start the new one, detached: log_recv_tcp_msg()
+ *     listener (IPv4) --+                        take the old connection away,
+ *                       +--> accept, then, as      whose receive thread ends
+ *     listener (IPv6) --+    one step under      record the new one
+ *                            g_takeover_lock:    start its receive thread, detached: log_recv_tcp_msg()
  *
  * Log lines at level 6 as "vex_log_manage".
  */

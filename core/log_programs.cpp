@@ -1,0 +1,246 @@
+#include "core/log_programs.h"
+
+#include "core/log_line.h"
+#include "core/log_tools.h"
+
+#include <algorithm>
+#include <atomic>
+#include <climits>
+#include <cstdio>
+#include <cstring>
+#include <unistd.h>
+
+namespace
+{
+
+constexpr char kLogSource[] = "log_json_codec";
+
+constexpr auto kEndMax = std::chrono::seconds(3); /* that a command that ends programs is waited for */
+constexpr unsigned kModemStart = 2;               /* seconds until the modem's log program can be connected to */
+
+constexpr char kModemConfig[] = "/logfs/logconf/Diag.cfg"; /* without it there is no modem log */
+constexpr char kModemConfig2[] = "/logfs/logconf/Diag.cfg2";
+constexpr char kUsbInterface[] = "/sys/class/net/usb0";
+
+struct program_state {
+    log_mutex run_lock LOG_ACQUIRED_BEFORE(g_registry_lock);
+    std::atomic<const log_program_change *> newest{nullptr};
+    pid_t child LOG_GUARDED_BY(run_lock) = -1; /* what the latest change has left behind */
+    int ending LOG_GUARDED_BY(run_lock) = 0;   /* commands that end programs are under way */
+    std::condition_variable ended;
+};
+
+program_state g_programs[2];
+
+program_state &state_of(log_kind kind)
+{
+    return g_programs[static_cast<std::size_t>(kind)];
+}
+
+bool has_second_config()
+{
+    return access("/logfs/logconf//Diag.cfg2", F_OK) == 0;
+}
+
+bool has_config()
+{
+    if (access("/logfs/logconf//Diag.cfg", F_OK) == 0)
+        return true;
+    LOG_NOTE("qxdm Diag.cfg is not exisit\n");
+    return false;
+}
+
+/* Whether this is a plug-in module in a PC, which reaches it by USB only. */
+bool is_usb_module()
+{
+    char product_type[16] = {};
+    vex_get_nv_item("product_type", product_type, sizeof product_type);
+    return std::strcmp(product_type, "MODULE") == 0 && access(kUsbInterface, F_OK) == 0;
+}
+
+void print_script(char (&cmd)[256], const log_syslog_items &items, const char *end)
+{
+    std::snprintf(cmd, sizeof cmd, "sh /usr/vex/vex_conf/scripts/vex_syslog.sh -L -o %s -l %s -s %s %s", items.path,
+                  items.level, items.size, end);
+}
+
+} // namespace
+
+log_program_change::log_program_change(log_kind kind) : kind_(kind)
+{
+    state_of(kind_).newest = this;
+}
+
+bool log_program_change::is_newest() const
+{
+    if (state_of(kind_).newest == this)
+        return true;
+    LOG_NOTE("a newer start or end of this log has come, nothing is started\n");
+    return false;
+}
+
+void log_program_change::settle()
+{
+    program_state &state = state_of(kind_);
+    const auto end = log_clock::now() + kEndMax;
+    const log_lock hold{state.run_lock};
+    while (state.ending > 0 && log_clock::now() < end)
+        state.run_lock.wait_until(state.ended, end);
+    if (const pid_t child = std::exchange(state.child, -1); child != -1)
+        log_end_child(child);
+}
+
+void log_program_change::end(const char *cmd)
+{
+    program_state &state = state_of(kind_);
+    {
+        const log_lock hold{state.run_lock};
+        ++state.ending;
+    }
+    log_exec_cmd(cmd);
+    {
+        const log_lock hold{state.run_lock};
+        --state.ending;
+    }
+    state.ended.notify_all();
+}
+
+void log_program_change::start(const char *cmd, int handed_fd)
+{
+    const log_lock hold{state_of(kind_).run_lock};
+    if (is_newest())
+        log_exec_cmd_with(cmd, handed_fd);
+}
+
+void log_program_change::start_behind(const char *cmd)
+{
+    program_state &state = state_of(kind_);
+    const log_lock hold{state.run_lock};
+    if (is_newest())
+        state.child = log_exec_cmd_behind(cmd);
+}
+
+void log_reap_programs()
+{
+    for (program_state &state : g_programs) {
+        if (!state.run_lock.try_acquire())
+            continue;
+        if (state.child != -1 && log_child_ended(state.child))
+            state.child = -1;
+        state.run_lock.release();
+    }
+}
+
+log_syslog_items log_read_syslog_items(int field_size)
+{
+    log_syslog_items items;
+    vex_get_nv_item("syslog_path", items.path, field_size);
+    vex_get_nv_item("syslog_level", items.level, field_size);
+    vex_get_nv_item("syslog_size", items.size, field_size);
+    return items;
+}
+
+void log_start_local_syslog()
+{
+    char cmd[256];
+    print_script(cmd, log_read_syslog_items(16), "");
+    log_exec_cmd(cmd);
+}
+
+void log_restart_local_syslog(log_program_change &change, const log_syslog_items &items)
+{
+    char cmd[256];
+    print_script(cmd, items, "&");
+    change.settle();
+    change.start_behind(cmd);
+}
+
+void log_end_syslog(log_program_change &change)
+{
+    change.settle();
+    change.end("killall -9 syslogd");
+}
+
+void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_class)
+{
+    log_end_syslog(change);
+    char cmd[256];
+    std::snprintf(cmd, sizeof cmd, ip_class == 2 ? "syslogd -R [%s]:%d &" : "syslogd -R %s:%d &", ip, kLogSyslogPort);
+    change.start(cmd);
+}
+
+void log_write_syslog_to(log_program_change &change, int fd)
+{
+    char cmd[256];
+    std::snprintf(cmd, sizeof cmd, "syslogd -R tcp_fd=%d &", fd);
+    LOG_NOTE("cmd=[%s]\n", cmd);
+    log_end_syslog(change);
+    change.start(cmd, fd);
+}
+
+int log_syslog_size_max()
+{
+    char path[16] = {};
+    vex_get_nv_item("syslog_path", path, sizeof path);
+    char cmd[128];
+    std::snprintf(cmd, sizeof cmd, "df -h | grep %s |awk '{print $2}' | cut -d 'M' -f 1", path);
+    char size[128] = {};
+    vex_popen(cmd, size, sizeof size);
+    return std::clamp(log_text_to_int(size), 0, INT_MAX / 1024) * 1024;
+}
+
+log_modem_start log_prepare_modem(log_program_change &change)
+{
+    change.settle();
+    change.end("killall -9 diag_mdlog");
+    change.end("killall -9 diag_socket_log");
+    if (!has_config())
+        return log_modem_start::no_config;
+    if (is_usb_module()) {
+        char cmd[256];
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -o /tmp/diag_logs -f %s -n 2 -s 10 -R %s -P %d &", kModemConfig,
+                      kLogModemUsbAddress, kLogModemPort);
+        change.start(cmd);
+        sleep(kModemStart);
+        return log_modem_start::on_usb;
+    }
+    log_exec_cmd("echo 3 > /proc/sys/vm/drop_caches &");
+    log_exec_cmd("rm /tmp/diag_logs &");
+    return log_modem_start::ready;
+}
+
+void log_offer_modem_at(log_program_change &change, const char *ip)
+{
+    char cmd[256];
+    if (has_second_config())
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -m %s -o /tmp/diag_logs\t-n 2 -s 10 -R %s -P %d &",
+                      kModemConfig, kModemConfig2, ip, kLogModemPort);
+    else
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs  -n 2 -s 10 -R %s -P %d &", kModemConfig, ip,
+                      kLogModemPort);
+    change.start(cmd);
+    sleep(kModemStart);
+}
+
+bool log_prepare_modem_socket(log_program_change &change)
+{
+    change.settle();
+    change.end("killall -9 diag_mdlog");
+    if (!has_config())
+        return false;
+    log_exec_cmd("echo 3 > /proc/sys/vm/drop_caches");
+    log_exec_cmd("rm /tmp/diag_logs");
+    return true;
+}
+
+void log_write_modem_to(log_program_change &change, int fd)
+{
+    char cmd[256];
+    if (has_second_config())
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -m %s -o /tmp/diag_logs\t-n 2 -s 10 -R tcp_fd=%d &",
+                      kModemConfig, kModemConfig2, fd);
+    else
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs -n 2 -s 10 -R tcp_fd=%d &", kModemConfig,
+                      fd);
+    change.start(cmd, fd);
+}

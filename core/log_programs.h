@@ -1,0 +1,108 @@
+/*
+ * What writes the device's two logs: every command line that starts or ends syslogd, diag_mdlog and the system log's
+ * script, in both of the daemon's modes.
+ *
+ * Programs are changed by several threads, and a change takes a while. The newest one wins: an older one that has not
+ * started its program yet does not start it any more. Programs are ended without a lock, before others are started, so
+ * that one that hangs holds up nobody for long.
+ */
+#ifndef CORE_LOG_PROGRAMS_H
+#define CORE_LOG_PROGRAMS_H
+
+#include "core/log_lock.h"
+#include "core/log_registry.h"
+
+#include <sys/types.h>
+
+enum class log_kind {
+    syslog, /* the system log */
+    qxdm,   /* the modem's log */
+};
+
+/* One change of what writes a log. While it lives it is the newest, or has been overtaken. For one thread. */
+class log_program_change
+{
+public:
+    /* From here on it is the newest one. */
+    explicit log_program_change(log_kind kind);
+    log_program_change(const log_program_change &) = delete;
+    log_program_change &operator=(const log_program_change &) = delete;
+
+    /* Waits for what earlier changes have left under way: 3 seconds for their commands that end programs, then for a
+     * restart of the local system log as long as log_end_child() gives it. */
+    void settle();
+
+    /* Runs a command that ends programs. */
+    void end(const char *cmd);
+
+    /* Starts a program, which inherits `handed_fd` where that is not -1; or, behind, as a child that the next change
+     * waits for. Not when a newer change has come, which is logged. */
+    void start(const char *cmd, int handed_fd = -1);
+    void start_behind(const char *cmd);
+
+private:
+    bool is_newest() const;
+
+    const log_kind kind_;
+};
+
+/* Ends a child that has been left behind by a change, when it has ended by itself: nobody else would learn of it before
+ * the next change. For start-up's loop. */
+void log_reap_programs();
+
+/* ---- The system log ---- */
+
+/* The NV items `syslog_path`, `syslog_level` and `syslog_size`, as their script takes them. */
+struct log_syslog_items {
+    char path[32] = {};
+    char level[32] = {};
+    char size[32] = {};
+};
+
+/* Reads them, cut to `field_size` - 1 characters; `field_size` is up to 32. */
+log_syslog_items log_read_syslog_items(int field_size);
+
+/* Starts the device's own system log, and waits until its script has ended. Before there are any threads. */
+void log_start_local_syslog();
+
+/* Starts the device's own system log again, behind. */
+void log_restart_local_syslog(log_program_change &change, const log_syslog_items &items);
+
+/* Ends syslogd, which writes to whatever it was told. */
+void log_end_syslog(log_program_change &change);
+
+/* Has the system log sent to a log tool, over UDP. `ip_class` is that of log_isValidIpOrUrl(). */
+constexpr int kLogSyslogPort = 1514; /* on the log tool */
+void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_class);
+
+/* Has the system log written to a socket. */
+void log_write_syslog_to(log_program_change &change, int fd);
+
+/* Size of the partition that the NV item `syslog_path` lies on, in KB: the number that df shows for it in MB, times
+ * 1024; 0 when df has no line for it. Runs df and waits for it. */
+int log_syslog_size_max();
+
+/* ---- The modem's log ---- */
+
+constexpr int kLogModemPort = 25555;                    /* TCP, on the device */
+constexpr char kLogModemUsbAddress[] = "192.168.255.1"; /* the device, for a PC on its USB port */
+
+/* How a new modem log may go on. */
+enum class log_modem_start {
+    ready,     /* to be started */
+    no_config, /* it has no configuration (logged) */
+    on_usb,    /* this is a plug-in module in a PC, which it can only go to: it has been started there */
+};
+
+/* Ends the modem's log and makes ready for a new one. */
+log_modem_start log_prepare_modem(log_program_change &change);
+
+/* Has the modem's log offered at the address, to whoever connects to it there. */
+void log_offer_modem_at(log_program_change &change, const char *ip);
+
+/* Makes ready to have the modem's log written to a socket, then has it written there. False, and nothing is to be
+ * written, without a configuration (logged). */
+bool log_prepare_modem_socket(log_program_change &change);
+void log_write_modem_to(log_program_change &change, int fd);
+
+#endif
