@@ -24,7 +24,7 @@ constexpr auto kPatience = std::chrono::seconds(10);
     std::exit(1);
 }
 
-/* A receive buffer of one size for all: the kernel's own choice, made anew for each connection, may double the
+/* A receive buffer of one size for all: the kernel's own choice, made for each connection, may double the
  * speed. */
 void fix_window(int fd)
 {
@@ -131,7 +131,7 @@ sending_cost take_records(const tls_link &link, std::size_t content, pid_t sende
         if (n <= 0)
             give_up("archive");
         if (start.seconds == 0)
-            start = {now(), processor_time(sender)};
+            start = {seconds_now(), processor_time(sender)};
         held += static_cast<std::size_t>(n);
         for (; at + kHeader <= held; at += kHeader + (piece[at + 3] << 8 | piece[at + 4]))
             content -= std::min(content, static_cast<std::size_t>(piece[at + 3] << 8 | piece[at + 4]) - kOverhead);
@@ -140,7 +140,7 @@ sending_cost take_records(const tls_link &link, std::size_t content, pid_t sende
         at -= held - rest;
         held = rest;
     }
-    return {now() - start.seconds, processor_time(sender) - start.processor};
+    return {seconds_now() - start.seconds, processor_time(sender) - start.processor};
 }
 
 double fetch_from_library_server(pid_t server)
@@ -228,7 +228,7 @@ sending_cost relay_by(const log_server &server, const std::vector<std::string> &
     return take_records(link, kLogSize, relay.pid());
 }
 
-/* Puts the feeder in the place of the device's system log program, and writes stunnel's configuration. */
+/* Installs the feeder in place of the device's system log program, and writes stunnel's configuration. */
 void prepare_relays(const char *feeder, int write_size)
 {
     shell((std::string("cp --remove-destination ") + feeder + " /usr/vex/override/syslogd").c_str());

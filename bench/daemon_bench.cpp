@@ -176,15 +176,15 @@ void measure_start(const std::string &floor_server)
     const comparison us = compare(
         kStarts,
         [] {
-            const double start = now();
+            const double start = seconds_now();
             const program daemon({"vex_log_manage"});
             connect_to(kDaemonPort);
-            return (now() - start) * 1e6;
+            return (seconds_now() - start) * 1e6;
         },
         [&] {
-            const double start = now();
+            const double start = seconds_now();
             program({floor_server, "system", script}).wait();
-            return (now() - start) * 1e6;
+            return (seconds_now() - start) * 1e6;
         });
     std::printf("start until it listens         %8.2f ms   system log script %8.2f ms   beyond it %.2f ms\n",
                 us.daemon / 1e3, us.floor / 1e3, (us.daemon - us.floor) / 1e3);

@@ -28,7 +28,7 @@ namespace
 constexpr std::size_t kUploadSize = 50000; /* data bytes of an upload's frame */
 constexpr std::size_t kReadSize = 2000;
 
-char **g_words; /* what stands behind the port */
+char **g_words; /* what follows the port */
 
 bool send_whole(int fd, const char *bytes, std::size_t len)
 {

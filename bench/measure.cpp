@@ -38,7 +38,7 @@ void prepare_measuring()
     setenv("VEX_LOG_LEVEL", "0", 1);
 }
 
-double now()
+double seconds_now()
 {
     return std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch()).count();
 }
@@ -90,9 +90,9 @@ unique_fd connect_to(std::uint16_t port)
     to.sin_port = htons(port);
     to.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     unique_fd fd{socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0)};
-    const double end = now() + 10;
+    const double end = seconds_now() + 10;
     while (connect(fd.get(), reinterpret_cast<const sockaddr *>(&to), sizeof to) != 0) {
-        if (errno != ECONNREFUSED || now() > end)
+        if (errno != ECONNREFUSED || seconds_now() > end)
             give_up("connect");
         sched_yield();
     }
@@ -103,10 +103,10 @@ unique_fd connect_to(std::uint16_t port)
 
 double timed(int count, const std::function<void()> &work)
 {
-    const double start = now();
+    const double start = seconds_now();
     for (int i = 0; i < count; ++i)
         work();
-    return (now() - start) * 1e6 / count;
+    return (seconds_now() - start) * 1e6 / count;
 }
 
 void paired_rounds::add(int rounds, const std::function<double()> &of_daemon, const std::function<double()> &of_floor)
@@ -162,12 +162,12 @@ double read_archive(const std::function<ssize_t(void *bytes, std::size_t len)> &
         if (n <= 0)
             give_up("archive");
         if (start == 0) { /* the first frame begins here, and all have its control text */
-            start = now();
+            start = seconds_now();
             left = kArchiveSize + frames * (12 + static_cast<unsigned char>(piece[5]));
         }
         left -= static_cast<std::size_t>(n);
     } while (left > 0);
-    return now() - start;
+    return seconds_now() - start;
 }
 
 double processor_time(pid_t pid)

@@ -1,5 +1,5 @@
 /*
- * What the benchmarks measure with. Each figure stands beside a floor in the same run: rounds of both alternate, and
+ * What the benchmarks measure with. Each figure comes beside a floor in the same run: rounds of both alternate, and
  * medians are compared. Everything runs on one processor, so that a round costs what the work costs and not what
  * waking another processor costs. What goes wrong ends the program.
  */
@@ -20,7 +20,7 @@ constexpr std::size_t kArchiveSize = 256 << 20;
 /* Puts this program and all that it starts on one processor, and has the daemon log failures only. */
 void prepare_measuring();
 
-double now(); /* seconds */
+double seconds_now(); /* seconds */
 [[noreturn]] void give_up(const char *what);
 void shell(const char *command);
 

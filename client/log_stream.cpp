@@ -85,18 +85,18 @@ shared_stream &current(log_kind kind) LOG_REQUIRES(g_registry_lock)
     return g_current[static_cast<std::size_t>(kind)];
 }
 
-/* The stream whose link stands: an older one until the current one's link is announced. */
-shared_stream standing(log_kind kind) LOG_REQUIRES(g_registry_lock)
+/* The stream whose link is in use: an older one until the current one's link is announced. */
+shared_stream used_stream(log_kind kind) LOG_REQUIRES(g_registry_lock)
 {
     const shared_stream &newest = current(kind);
     return newest && !newest->announced && newest->before ? newest->before : newest;
 }
 
-/* Shows in the registry which link stands. */
+/* Shows in the registry which link is in use. */
 void publish(log_kind kind) LOG_REQUIRES(g_registry_lock)
 {
     const stream_names &names = names_of(kind);
-    const shared_stream stream = standing(kind);
+    const shared_stream stream = used_stream(kind);
     g_sock_fd.*names.ssl = stream && stream->link ? stream->link->tls.get() : nullptr;
     g_sock_fd.*names.fd = stream && stream->announced ? stream->link->fd.get() : -1;
     *names.local_fd = stream ? stream->local.get() : -1;
@@ -219,7 +219,7 @@ void log_locally(log_kind kind, log_program_change &change)
         log_restart_local_syslog(change, log_read_syslog_items(32));
     } else {
         change.settle();
-        change.end("diag_mdlog -k ");
+        change.end_by("diag_mdlog -k ");
     }
 }
 
@@ -416,11 +416,11 @@ void start_link(const shared_stream &stream)
 
 /* ---- The confirmation ---- */
 
-/* The stream whose data link stands; none without one. */
+/* The stream whose data link is in use; none without one. */
 shared_stream linked_stream(log_kind kind)
 {
     const log_lock hold{g_registry_lock};
-    const shared_stream stream = standing(kind);
+    const shared_stream stream = used_stream(kind);
     return stream && stream->announced ? stream : nullptr;
 }
 
@@ -565,7 +565,7 @@ void log_stream_end(log_kind kind)
         log_end_syslog(*change);
     } else {
         change->settle();
-        change->end("diag_mdlog -k");
+        change->end_by("diag_mdlog -k");
     }
     {
         const log_lock hold{g_registry_lock};

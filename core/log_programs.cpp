@@ -90,7 +90,7 @@ void log_program_change::settle()
         log_end_child(child);
 }
 
-void log_program_change::end(const char *cmd)
+void log_program_change::end_by(const char *cmd)
 {
     program_state &state = state_of(kind_);
     {
@@ -105,14 +105,14 @@ void log_program_change::end(const char *cmd)
     state.ended.notify_all();
 }
 
-void log_program_change::start(const char *cmd, int handed_fd)
+void log_program_change::launch(const char *cmd, int handed_fd)
 {
     const log_lock hold{state_of(kind_).run_lock};
     if (is_newest())
         log_exec_cmd_with(cmd, handed_fd);
 }
 
-void log_program_change::start_behind(const char *cmd)
+void log_program_change::launch_behind(const char *cmd)
 {
     program_state &state = state_of(kind_);
     const log_lock hold{state.run_lock};
@@ -152,13 +152,13 @@ void log_restart_local_syslog(log_program_change &change, const log_syslog_items
     char cmd[256];
     print_script(cmd, items, "&");
     change.settle();
-    change.start_behind(cmd);
+    change.launch_behind(cmd);
 }
 
 void log_end_syslog(log_program_change &change)
 {
     change.settle();
-    change.end("killall -9 syslogd");
+    change.end_by("killall -9 syslogd");
 }
 
 void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_class)
@@ -166,7 +166,7 @@ void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_
     log_end_syslog(change);
     char cmd[256];
     std::snprintf(cmd, sizeof cmd, ip_class == 2 ? "syslogd -R [%s]:%d &" : "syslogd -R %s:%d &", ip, kLogSyslogPort);
-    change.start(cmd);
+    change.launch(cmd);
 }
 
 void log_write_syslog_to(log_program_change &change, int fd)
@@ -175,7 +175,7 @@ void log_write_syslog_to(log_program_change &change, int fd)
     std::snprintf(cmd, sizeof cmd, "syslogd -R tcp_fd=%d &", fd);
     LOG_NOTE("cmd=[%s]\n", cmd);
     log_end_syslog(change);
-    change.start(cmd, fd);
+    change.launch(cmd, fd);
 }
 
 int log_syslog_size_max()
@@ -192,15 +192,15 @@ int log_syslog_size_max()
 log_modem_start log_prepare_modem(log_program_change &change)
 {
     change.settle();
-    change.end("killall -9 diag_mdlog");
-    change.end("killall -9 diag_socket_log");
+    change.end_by("killall -9 diag_mdlog");
+    change.end_by("killall -9 diag_socket_log");
     if (!has_config())
         return log_modem_start::no_config;
     if (is_usb_module()) {
         char cmd[256];
         std::snprintf(cmd, sizeof cmd, "diag_mdlog -o /tmp/diag_logs -f %s -n 2 -s 10 -R %s -P %d &", kModemConfig,
                       kLogModemUsbAddress, kLogModemPort);
-        change.start(cmd);
+        change.launch(cmd);
         sleep(kModemStart);
         return log_modem_start::on_usb;
     }
@@ -218,14 +218,14 @@ void log_offer_modem_at(log_program_change &change, const char *ip)
     else
         std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs  -n 2 -s 10 -R %s -P %d &", kModemConfig, ip,
                       kLogModemPort);
-    change.start(cmd);
+    change.launch(cmd);
     sleep(kModemStart);
 }
 
 bool log_prepare_modem_socket(log_program_change &change)
 {
     change.settle();
-    change.end("killall -9 diag_mdlog");
+    change.end_by("killall -9 diag_mdlog");
     if (!has_config())
         return false;
     log_exec_cmd("echo 3 > /proc/sys/vm/drop_caches");
@@ -242,5 +242,5 @@ void log_write_modem_to(log_program_change &change, int fd)
     else
         std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs -n 2 -s 10 -R tcp_fd=%d &", kModemConfig,
                       fd);
-    change.start(cmd, fd);
+    change.launch(cmd, fd);
 }

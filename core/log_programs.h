@@ -33,12 +33,12 @@ public:
     void settle();
 
     /* Runs a command that ends programs. */
-    void end(const char *cmd);
+    void end_by(const char *cmd);
 
     /* Starts a program, which inherits `handed_fd` where that is not -1; or, behind, as a child that the next change
      * waits for. Not when a newer change has come, which is logged. */
-    void start(const char *cmd, int handed_fd = -1);
-    void start_behind(const char *cmd);
+    void launch(const char *cmd, int handed_fd = -1);
+    void launch_behind(const char *cmd);
 
 private:
     bool is_newest() const;

@@ -26,7 +26,8 @@ std::condition_variable g_turn_change; /* a turn has ended, or a link was taken 
 
 thread_local log_link *t_served;
 
-bool stands()
+/* Whether the link that the calling thread serves, if any, is still its own. */
+bool is_wanted()
 {
     return t_served == nullptr || !t_served->taken;
 }
@@ -116,13 +117,13 @@ log_link *log_served()
 log_cmd_turn::log_cmd_turn(bool alone) : alone_(alone)
 {
     if (!alone_) {
-        granted_ = stands();
+        granted_ = is_wanted();
         return;
     }
     const log_lock hold{g_registry_lock};
-    while (g_turn_taken && stands())
+    while (g_turn_taken && is_wanted())
         g_registry_lock.wait(g_turn_change);
-    granted_ = stands();
+    granted_ = is_wanted();
     if (granted_)
         g_turn_taken = true;
 }

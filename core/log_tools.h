@@ -60,7 +60,7 @@ int log_exec_cmd_with(const char *cmdStr, int handed_fd);
  * by which it must be asked for or ended one day; -1 when it could not be started. */
 pid_t log_exec_cmd_behind(const char *cmdStr);
 
-/* Whether such a child has ended; then it is forgotten and its number is not to be used any more. */
+/* Whether such a child has ended; then it is forgotten and its number must not be used any more. */
 bool log_child_ended(pid_t child);
 
 /* Waits until such a child has ended and forgets it. After 3 seconds it is asked to (SIGTERM), after 2 more killed, both

@@ -1,11 +1,11 @@
 #include "core/log_tools.h"
 
 #include "core/log_line.h"
+#include "core/log_record.h"
 
 #include <climits>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
 
 namespace
 {
@@ -14,10 +14,6 @@ constexpr char kLogSource[] = "log_tools";
 
 constexpr std::size_t kHexPiece = 500; /* characters of a hex dump in one log line */
 constexpr int kHexMax = INT_MAX / 4;   /* bytes of a hex dump whose text a 32-bit size can count */
-
-struct free_deleter {
-    void operator()(void *memory) const { std::free(memory); }
-};
 
 } // namespace
 
@@ -44,7 +40,7 @@ void log_print_hex_buf(const void *data, int count, const char *tag)
     }
     /* One piece to spare, so that the last one is copied whole like the others; its tail is zeros. */
     const std::size_t text_size = 2 * static_cast<std::size_t>(count) + kHexPiece;
-    const std::unique_ptr<char, free_deleter> text{static_cast<char *>(std::calloc(1, text_size))};
+    const std::unique_ptr<char, log_free> text{static_cast<char *>(std::calloc(1, text_size))};
     if (!text) {
         LOG_NOTE("%s: malloc tmpBuf fail\n", __func__);
         return;

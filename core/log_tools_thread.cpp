@@ -9,7 +9,7 @@ constexpr char kLogSource[] = "log_tools";
 
 /* Bytes of stack for a thread. Frames live on the heap, so the deepest use is a JSON text of nothing but brackets, with
  * about 100 KB. The usual 8 MB would make the end of a thread dearer, as the kernel looks through all of it. */
-constexpr std::size_t kStackSize = 256 * 1024;
+constexpr std::size_t kStackSize = std::size_t{256} * 1024;
 
 } // namespace
 

@@ -52,7 +52,7 @@ void check_store(const std::string &name, const std::string &level, std::string_
         return;
     }
     promise(stored.size() < kBspRecordSize, "a record has room in its field");
-    promise(stored.find(name + ',' + level + ';') != std::string::npos, "what was stored stands in the record");
+    promise(stored.find(name + ',' + level + ';') != std::string::npos, "what was stored is in the record");
     promise(count == kRestored || !comparable || level_of(name) == level, "what was stored is found");
     for (std::size_t i = 0; i < count; ++i)
         promise(others[i] == name || level_of(others[i]) == levels[i], "other modules keep their levels");

@@ -32,7 +32,7 @@ void check_decoding(const std::uint8_t *data, std::size_t size, log_msg *msg)
     promise((log_FindHead_pkg(data, data + size) == data) == frame.starts_with(PKG_HEAD) &&
                 (size < kPkgTagLen ||
                  (log_FindTail_pkg(data + size - kPkgTagLen, data + size) != nullptr) == frame.ends_with(PKG_TAIL)),
-            "a tag is found where it stands");
+            "a tag is found where it is");
     log_msg_clear(msg);
     const bool decoded = log_decode_msg(data, size, msg) == 0;
     promise(decoded == is_frame(frame), "a frame is decoded, anything else is not");

@@ -1,6 +1,6 @@
 /*
  * Every handler's control text, on a device whose commands are written down instead of run. Every request is
- * answered once, by a frame that bears its number and has a control text of at most its bound; what is uploaded and
+ * answered once, by a frame that has its number and has a control text of at most its bound; what is uploaded and
  * what is fetched arrives, and is not changed on its way.
  *
  * The first byte of an input says how the device is (see device_traits). The rest is up to four control texts, one a
@@ -112,7 +112,7 @@ std::string check_replies(const tool_end &tool, int msgid)
     std::string data;
     for (std::string_view bytes = text_of(received, held); !bytes.empty(); ++count) {
         last = take_reply(bytes);
-        promise(last.control.empty() || last.control.starts_with(number), "a reply bears its request's number");
+        promise(last.control.empty() || last.control.starts_with(number), "a reply has its request's number");
         promise(last.control.size() <= (msgid == 3 ? kVersionReplyMax : kReplyMax), "a reply is not too long");
         data += last.data;
     }
@@ -191,7 +191,7 @@ int LLVMFuzzerTestOneInput(const std::uint8_t *data, std::size_t size)
     log_cmd_record(link);
     const std::string uploaded = run_requests(tool, requests, g_device.brings_data ? brought : "");
     if (!uploaded.empty())
-        promise(content_of(kPackage) == uploaded, "what was uploaded stands in the package");
+        promise(content_of(kPackage) == uploaded, "what was uploaded is in the package");
     clean_up(tool);
     log_cmd_forget(*link);
     return 0;

@@ -30,7 +30,7 @@ void check_read(const char *name, const std::optional<std::string> &value)
     constexpr std::size_t kRoom = 16;
     char buffer[kRoom + 1];
     std::memset(buffer, '?', sizeof buffer);
-    promise((vex_nvconfig_read(name, buffer, kRoom) == 1) == value.has_value(), "an item that stands there is read");
+    promise((vex_nvconfig_read(name, buffer, kRoom) == 1) == value.has_value(), "an item that is there is read");
     const std::size_t len = std::min(value.value_or("").size(), kRoom);
     promise(!value || value->compare(0, len, buffer, len) == 0, "as much of it as has room");
     promise(!value || buffer[len] == (len < kRoom ? '\0' : '?'), "with its end where that has room");

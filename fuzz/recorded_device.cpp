@@ -63,7 +63,7 @@ int __wrap_pthread_create(pthread_t *, const pthread_attr_t *, void *(*)(void *)
 }
 }
 
-/* A start of a live log gets no threads: one of these two takes the place of what would make them. */
+/* A start of a live log gets no threads: one of these two replaces what would make them. */
 int refuse_thread(log_thread_task *task, void *argument) __asm__("__wrap__Z17log_thread_createP15log_thread_taskPv");
 int refuse_thread(log_thread_task *, void *)
 {

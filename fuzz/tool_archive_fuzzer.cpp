@@ -23,7 +23,7 @@ const std::filesystem::path &folder()
     return path;
 }
 
-/* What the tool says is not to be looked at here; a broken promise bypasses these. */
+/* What the tool says is not looked at here; a broken promise bypasses these. */
 void silence()
 {
     static const bool silenced = (stdout = std::fopen("/dev/null", "w")) && (stderr = std::fopen("/dev/null", "w"));

@@ -63,7 +63,7 @@ live_log_answer end_syslog()
     return answer("udp", 0, "");
 }
 
-/* Ends the modem's log and makes ready for a new one; the answer when that one is not to come, or has been started
+/* Ends the modem's log and makes ready for a new one; the answer when there will be none, or it has been started
  * already. */
 std::optional<live_log_answer> prepare_modem(log_program_change &change)
 {
@@ -91,7 +91,7 @@ live_log_answer end_modem()
 {
     log_program_change change{log_kind::qxdm};
     change.settle();
-    change.end("killall -9 diag_mdlog");
+    change.end_by("killall -9 diag_mdlog");
     return answer("tcp", 0, "");
 }
 

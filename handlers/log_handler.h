@@ -1,4 +1,4 @@
-/* The steps that all handlers share. Log lines of handlers bear the source "log_json_codec". */
+/* The steps that all handlers share. Log lines of handlers have the source "log_json_codec". */
 #ifndef HANDLERS_LOG_HANDLER_H
 #define HANDLERS_LOG_HANDLER_H
 

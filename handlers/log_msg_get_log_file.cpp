@@ -1,12 +1,10 @@
 #include "core/log_filemgr.h"
 #include "core/log_line.h"
+#include "core/log_record.h"
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
 #include "protocol/log_pkg_send.h"
-
-#include <memory>
-#include <new>
 
 namespace
 {
@@ -101,7 +99,7 @@ int log_msg_get_log_file(const char *control, const unsigned char *data, std::in
         reply_failure("Fail:Compressed logfs error");
         return -1;
     }
-    const std::unique_ptr<log_outgoing> piece{new (std::nothrow) log_outgoing};
+    const auto piece = log_allocate<log_outgoing>();
     FILE *archive = piece ? log_open_file(kArchive, kFileReadBinary) : nullptr;
     if (archive == nullptr) {
         reply_failure("Fail:Open log file error");

@@ -4,8 +4,8 @@
 namespace
 {
 
-#define LOG_HANDLER_ROW(msgid, handler, alone) {msgid, handler, alone},
-#define LOG_HANDLER_NONE(msgid) {msgid, nullptr},
+#define LOG_HANDLER_ROW(msgid, handler, alone) {handler, msgid, alone},
+#define LOG_HANDLER_NONE(msgid) {nullptr, msgid},
 constexpr log_msg_handler_entry kTable[] = {LOG_MSG_HANDLERS(LOG_HANDLER_ROW, LOG_HANDLER_NONE)};
 
 } // namespace

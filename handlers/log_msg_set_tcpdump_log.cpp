@@ -46,7 +46,7 @@ void stop_captures()
     log_exec_cmd("killall tcpdump");
 }
 
-/* Starts one capture in the background; its file bears the interface's name. */
+/* Starts one capture in the background; its file has the interface's name. */
 void start_capture(const char *ifname, int snapshot_length, const char *path)
 {
     char interface[32] = {};

@@ -22,9 +22,9 @@
 using log_msg_handler = int (*)(const char *control, const unsigned char *data, std::int32_t dataLen);
 
 struct log_msg_handler_entry {
-    std::int32_t msgid;
     log_msg_handler handler; /* null: the id is known and nothing is done */
-    bool alone = false;      /* in client mode, too, it never runs beside another such (log_cmd_turn) */
+    std::int32_t msgid;
+    bool alone = false; /* in client mode, too, it never runs beside another such (log_cmd_turn) */
 };
 
 extern const std::span<const log_msg_handler_entry> log_msg_handler_table;

@@ -65,7 +65,7 @@ struct log_pkg_header {
 /* Reads what can be told of a frame by the `held` bytes at its start, whatever its head tag is. */
 log_pkg_header log_pkg_read_header(const unsigned char *frame, std::size_t held);
 
-/* `at` when the head tag (the tail tag) stands there, whole and before `end`; else null. They do not search. */
+/* `at` when the head tag (the tail tag) is there, whole and before `end`; else null. They do not search. */
 const unsigned char *log_FindHead_pkg(const unsigned char *at, const unsigned char *end);
 const unsigned char *log_FindTail_pkg(const unsigned char *at, const unsigned char *end);
 

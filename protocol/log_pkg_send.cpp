@@ -1,6 +1,7 @@
 #include "protocol/log_pkg_send.h"
 
 #include "core/log_line.h"
+#include "core/log_record.h"
 #include "core/log_registry.h"
 #include "core/log_tools.h"
 
@@ -36,7 +37,7 @@ int log_send_pkg_msg(int fd, log_tls_session *ssl, const char *control, const vo
 {
     if (fd < 0 || data == nullptr || control == nullptr)
         return -1;
-    const std::unique_ptr<log_outgoing> outgoing{new (std::nothrow) log_outgoing};
+    const auto outgoing = log_allocate<log_outgoing>();
     if (!outgoing) {
         LOG_NOTE("sendbuf malloc failed .\n");
         return -1;

@@ -5,7 +5,6 @@
 
 #include <cstddef>
 #include <cstring>
-#include <new>
 #include <optional>
 
 namespace
@@ -78,7 +77,7 @@ int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece
 {
     LOG_NOTE("enter %s len = [%d]\n", __func__, static_cast<int>(piece.size()));
     if (!state.incoming)
-        state.incoming.reset(new (std::nothrow) log_incoming);
+        state.incoming = log_allocate<log_incoming>();
     if (!state.incoming) {
         LOG_NOTE("LOG_RECV_PKG_LEN malloc failed.\n");
         return -1;

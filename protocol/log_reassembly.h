@@ -9,10 +9,10 @@
 #ifndef PROTOCOL_LOG_REASSEMBLY_H
 #define PROTOCOL_LOG_REASSEMBLY_H
 
+#include "core/log_record.h"
 #include "protocol/log_pkg_codec.h"
 
 #include <cstddef>
-#include <memory>
 #include <span>
 
 constexpr std::size_t LOG_RECV_PKG_LEN = 61440; /* bytes; held bytes are always fewer */
@@ -25,8 +25,8 @@ struct log_incoming {
 
 /* One connection's bytes that are not yet a frame. Lives and ends with the connection; one thread feeds it. */
 struct log_reassembly {
-    std::unique_ptr<log_incoming> incoming; /* allocated by the first piece */
-    std::size_t recv_pkg_len = 0;           /* bytes held, from offset 0 */
+    log_record_ptr<log_incoming> incoming; /* allocated by the first piece */
+    std::size_t recv_pkg_len = 0;          /* bytes held, from offset 0 */
 };
 
 /*

@@ -123,7 +123,7 @@ void soak_device::check_log() const
     EXPECT_EQ("", others(kLogLine, kLogFile));
     if (testing::Test::HasFailure())
         ADD_FAILURE() << run_command("tail -n 30 /tmp/daemon.log; tail -c 2000 /tmp/daemon.out");
-    std::ofstream{kLogFile}; /* the next round's begins anew */
+    std::ofstream{kLogFile}; /* the next round's is empty */
 }
 
 long soak_device::memory() const

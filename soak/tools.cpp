@@ -27,7 +27,7 @@ bool upload(soak_peer &peer, dice &chance)
     return true;
 }
 
-/* One thing that a tool does; false when it had better connect anew. */
+/* One thing that a tool does; false when it should connect again. */
 bool act(soak_peer &peer, dice &chance)
 {
     switch (chance.below(10)) {

@@ -181,12 +181,13 @@ TEST_F(Daemon, KeepsReplacedToolsCommandsFromTheNewOne)
             tool_connection("::1").send(frame(kAskMode));
             ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =47", i + 1));
         }
-        const tool_connection second("::1");
-        second.send(frame(kAskMode));
+        const tool_connection second("::1"); /* nor is its confirmation of a data link run beside the other's command */
+        second.send(frame(R"({"msgid":"10","DataLink":{"imei":"356938035643809","ConnectType":"modemlog_connect"}})") +
+                    frame(kAskMode));
         EXPECT_EQ("(closed)", first.receive());
-        ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =47", 21));
+        ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =144"));
         EXPECT_TRUE(settles({3, 2})); /* two connections with their threads, and the pipe from df */
-        EXPECT_EQ(0, daemon_->logged("log_msg_mode_lpm_online"));
+        EXPECT_EQ(0, daemon_->logged("log_msg_mode_lpm_online") + daemon_->logged("killall -9 diag_mdlog"));
         std::ofstream("/tmp/go") << "go" << std::endl;
         EXPECT_EQ(kOnline, second.receive());
         EXPECT_EQ(kOnline, second.ask(kAskMode));

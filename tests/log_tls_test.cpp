@@ -17,15 +17,34 @@
 #include <tuple>
 #include <utility>
 
-/* The call of the library that always returns 0. */
+/* The call of the library that fails whenever it is made. */
 static const char *g_failing = "";
+
+/* What it is replaced by: calls that fail, of the right types. */
+static SSL_CTX *no_context(const SSL_METHOD * /*method*/)
+{
+    return nullptr;
+}
+static int fail_with(SSL_CTX * /*context*/)
+{
+    return 0;
+}
+static int fail_check(const SSL_CTX * /*context*/)
+{
+    return 0;
+}
 
 extern "C" {
 void *__real_dlsym(void *library, const char *name);
-void *__wrap_dlsym(void *library, const char *name)
+/* A sanitizer that is linked in calls it, too, before it is ready for anything that it watches. */
+__attribute__((no_sanitize("address", "undefined"))) void *__wrap_dlsym(void *library, const char *name)
 {
-    int (*const fails)() = [] { return 0; };
-    return std::strcmp(name, g_failing) == 0 ? reinterpret_cast<void *>(fails) : __real_dlsym(library, name);
+    if (*g_failing == '\0' || std::strcmp(name, g_failing) != 0)
+        return __real_dlsym(library, name);
+    if (std::strcmp(name, "SSL_CTX_new") == 0)
+        return reinterpret_cast<void *>(no_context);
+    return std::strcmp(name, "SSL_CTX_check_private_key") == 0 ? reinterpret_cast<void *>(fail_check)
+                                                               : reinterpret_cast<void *>(fail_with);
 }
 }
 

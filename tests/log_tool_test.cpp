@@ -46,6 +46,7 @@ TEST(LogTool, DoesEverythingOnARealDevice)
         EXPECT_EQ(0, status) << command;
         EXPECT_NE(std::string::npos, out.find(words)) << command << '\n' << out;
     };
+    says("--version", "vex_log_tool 1.0\n");
     says("version --host ::1", "Device at ::1 port 48888\n  model             VX-520\n");
     says("syslog", "System log: level 7, size 512 KB, at most 20480 KB\n");
     says("syslog 5 64", "System log: level 5, size 64 KB: the device was told so\n");

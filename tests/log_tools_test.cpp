@@ -117,7 +117,7 @@ log_options_result parse(std::vector<const char *> arguments)
     arguments.insert(arguments.begin(), "vex_log_manage");
     arguments.push_back(nullptr);
     g_platform = {};
-    optind = 0; /* starts getopt afresh */
+    optind = 0; /* starts getopt again */
     return log_parse_options(static_cast<int>(arguments.size()) - 1, const_cast<char **>(arguments.data()));
 }
 

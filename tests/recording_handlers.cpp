@@ -19,7 +19,7 @@ template <int msgid> int record(const char *control, const unsigned char *data, 
 
 template <int... n> std::array<log_msg_handler_entry, 11> all(std::integer_sequence<int, n...> /*rows*/)
 {
-    return {{{n + 1, n == 8 ? nullptr : record<n + 1>}...}};
+    return {{{n == 8 ? nullptr : record<n + 1>, n + 1}...}};
 }
 
 const auto kTable = all(std::make_integer_sequence<int, 11>());

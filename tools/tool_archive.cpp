@@ -139,7 +139,7 @@ fetch_result fetch(tool_device &device, const std::string &file, std::string &co
     return result;
 }
 
-/* Whether a file may stand there: nothing but another plain file is replaced. */
+/* Whether a file may be put there: nothing but another plain file is replaced. */
 bool replaceable(const std::string &file, std::string &why)
 {
     struct stat about {

@@ -31,7 +31,7 @@ std::string tool_command(const char *msgid, const char *group,
     for (const auto &[name, value] : members)
         cJSON_AddStringToObject(object, name, value.c_str());
     char *const printed = cJSON_PrintUnformatted(root.get());
-    const std::string text = printed != nullptr ? printed : "";
+    std::string text = printed != nullptr ? printed : "";
     cJSON_free(printed);
     return text;
 }

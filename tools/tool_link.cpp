@@ -59,7 +59,7 @@ std::string ended(const tool_link &link, const std::string &how)
 {
     return "the connection to " + link.where + " ended before the answer was there: " + how +
            (link.called
-                ? ". A device whose link has ended starts its log daemon anew and calls again; why it ended is in "
+                ? ". A device whose link has ended restarts its log daemon and calls again; why it ended is in "
                   "the device's own log"
                 : ". The device serves one log tool at a time, so another one may have taken it over; if not, "
                   "try again and look at the device's own log");

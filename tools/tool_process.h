@@ -8,7 +8,7 @@
  * of the output that goes away is an error like any other. */
 void tool_prepare_process();
 
-/* Writes bytes whole; false, with errno, when that is not to be had. */
+/* Writes bytes whole; false, with errno, when that fails. */
 bool tool_write_whole(int fd, const void *bytes, std::size_t len);
 
 /* The exit status, unless what was said could not be written to standard output. */

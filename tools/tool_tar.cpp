@@ -85,7 +85,7 @@ bool tool_check_tar(int fd, tool_packing packing, std::string &contents, std::st
         result = archive_read_data_skip(reader.get());
     }
     contents = std::to_string(files) + (files == 1 ? " file\n" : " files\n") + captures;
-    const void *rest = nullptr; /* what stands behind the tar's end belongs to the checksum too */
+    const void *rest = nullptr; /* what follows the tar's end belongs to the checksum too */
     la_ssize_t n = 0;
     while (result == ARCHIVE_EOF && (n = read_unpacked(reader.get(), source.get(), &rest)) > 0)
         continue;

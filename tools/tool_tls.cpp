@@ -10,7 +10,7 @@ namespace
 std::string last_error()
 {
     const char *const reason = ERR_reason_error_string(ERR_peek_last_error());
-    const std::string text = reason != nullptr ? reason : "the peer has hung up";
+    std::string text = reason != nullptr ? reason : "the peer has hung up";
     ERR_clear_error();
     return text;
 }

@@ -67,7 +67,7 @@ void add_capture(CLI::App &app, tool_words &words, tool_job &job)
 {
     CLI::App *capture = app.add_subcommand("capture", "capture packets into the device's logs");
     capture->require_subcommand(1);
-    CLI::App *start = capture->add_subcommand("start", "start anew, on up to four interfaces");
+    CLI::App *start = capture->add_subcommand("start", "start again, on up to four interfaces");
     start->add_option("INTERFACES", words.first, "such as eth0,wan,lan; wan and lan are the device's own")
         ->required()
         ->check([](const std::string &list) {
@@ -195,7 +195,8 @@ int main(int argc, char **argv)
     tool_job job;
     tool_serve_options serve;
     CLI::App app{"Controls and collects the diagnostic logs of a device."};
-    app.fallthrough(); /* common options may stand behind the command too */
+    app.set_version_flag("--version", "vex_log_tool " VEX_VERSION);
+    app.fallthrough(); /* common options may follow the command, too */
     add_common_options(app, device);
     add_commands(app, words, job);
     add_serve(app, serve, job);

@@ -205,7 +205,7 @@ void print_address(const socket_address &peer, char (&text)[kClientIpSize])
                   group[5], group[6], group[7]);
 }
 
-/* Makes the connection the command connection, in place of the one before it. */
+/* Makes the connection the command connection and takes it over from the one before. */
 void take_over(const listener_family &words, unique_fd client, const socket_address &peer)
 {
     char ip[kClientIpSize] = {};

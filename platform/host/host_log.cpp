@@ -28,7 +28,7 @@ log_sink open_sink()
 {
     const char *level = std::getenv("VEX_LOG_LEVEL");
     const char *path = std::getenv("VEX_LOG_FILE");
-    log_sink sink{level != nullptr ? std::atoi(level) : kDefaultLevel, -1};
+    log_sink sink{level != nullptr ? static_cast<int>(std::strtol(level, nullptr, 10)) : kDefaultLevel, -1};
     if (path != nullptr && *path != '\0')
         sink.fd = open(path, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
     if (sink.fd == -1)

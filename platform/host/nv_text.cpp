@@ -13,7 +13,7 @@ std::string_view next_line(std::string_view &text)
 }
 
 /* Whether the line is an item of that name. */
-bool bears(std::string_view line, std::string_view name)
+bool has_name(std::string_view line, std::string_view name)
 {
     return line.size() > name.size() && line[name.size()] == '=' && line.starts_with(name);
 }
@@ -34,7 +34,7 @@ std::string escape(std::string_view value)
     return out;
 }
 
-/* A backslash before anything else, as an editor may leave it, stands for itself. */
+/* A backslash before anything else, as an editor may leave it, is itself. */
 std::string unescape(std::string_view text)
 {
     std::string out;
@@ -66,7 +66,7 @@ std::optional<std::string> nv_text_get(std::string_view text, std::string_view n
 {
     for (std::size_t at = text.find(name); at != std::string_view::npos; at = text.find(name, at + 1)) {
         std::string_view from_name = text.substr(at);
-        if ((at == 0 || text[at - 1] == '\n') && bears(from_name, name))
+        if ((at == 0 || text[at - 1] == '\n') && has_name(from_name, name))
             return unescape(next_line(from_name).substr(name.size() + 1));
     }
     return std::nullopt;
@@ -79,7 +79,7 @@ std::string nv_text_set(std::string_view text, std::string_view name, std::strin
     bool placed = false;
     while (!text.empty()) {
         const std::string_view line = next_line(text);
-        if (!bears(line, name)) {
+        if (!has_name(line, name)) {
             out.append(line).append("\n");
         } else if (!placed) {
             out += item;
