@@ -37,7 +37,8 @@ struct log_stream {
 
     std::shared_ptr<log_link> link LOG_GUARDED_BY(g_registry_lock);     /* once it is connected */
     std::shared_ptr<log_stream> before LOG_GUARDED_BY(g_registry_lock); /* whom it takes over from when announced */
-    unique_fd local LOG_GUARDED_BY(g_registry_lock); /* our end of the program's connection to the intake */
+    /* Our end of the program's connection to the intake. */
+    std::shared_ptr<unique_fd> local LOG_GUARDED_BY(g_registry_lock);
     intake_state intake LOG_GUARDED_BY(g_registry_lock) = intake_state::none;
     bool announced LOG_GUARDED_BY(g_registry_lock) = false;
     bool ended LOG_GUARDED_BY(g_registry_lock) = false;       /* by whoever was first */
@@ -56,9 +57,14 @@ constexpr auto kEndAllMax = std::chrono::seconds(5); /* for all of it at the end
 
 using shared_stream = std::shared_ptr<log_stream>;
 
+/* What is different for the two logs. Their threads run the same bodies and have names of their own in the log. */
 struct stream_names {
     const char *connect_type;
     const char *intake_path;
+    const char *intake_starter;
+    const char *intake_body;
+    const char *link_starter;
+    const char *link_body;
     log_target *target;
     int log_sock_fd::*fd;
     log_tls_session *log_sock_fd::*ssl;
@@ -66,9 +72,12 @@ struct stream_names {
 };
 
 constexpr stream_names kNames[] = {
-    {"syslog_connect", kSyslogIntake, &syslog_target, &log_sock_fd::syslog_fd, &log_sock_fd::syslog_ssl,
-     &syslog_local_fd},
-    {"modemlog_connect", kQxdmIntake, &qxdm_target, &log_sock_fd::qxdm_fd, &log_sock_fd::qxdm_ssl, &qxdm_local_fd},
+    {"syslog_connect", kSyslogIntake, "vex_log_recv_syslog_thread", "log_recv_syslog_thread_proc",
+     "vex_log_client_syslog_thread", "log_client_syslog_thread_proc", &syslog_target, &log_sock_fd::syslog_fd,
+     &log_sock_fd::syslog_ssl, &syslog_local_fd},
+    {"modemlog_connect", kQxdmIntake, "vex_log_recv_qxdm_thread", "log_recv_qxdm_thread_proc",
+     "vex_log_client_qxdm_thread", "log_client_qxdm_thread_proc", &qxdm_target, &log_sock_fd::qxdm_fd,
+     &log_sock_fd::qxdm_ssl, &qxdm_local_fd},
 };
 
 shared_stream g_current[2] LOG_GUARDED_BY(g_registry_lock);
@@ -99,7 +108,7 @@ void publish(log_kind kind) LOG_REQUIRES(g_registry_lock)
     const shared_stream stream = used_stream(kind);
     g_sock_fd.*names.ssl = stream && stream->link ? stream->link->tls.get() : nullptr;
     g_sock_fd.*names.fd = stream && stream->announced ? stream->link->fd.get() : -1;
-    *names.local_fd = stream ? stream->local.get() : -1;
+    *names.local_fd = stream && stream->local ? stream->local->get() : -1;
 }
 
 /* Ends all waits for a stream that has ended: its threads are done soon. */
@@ -138,9 +147,9 @@ void count_at_work(int change)
 
 /* ---- The intake's thread ---- */
 
-void run_intake(const char *body, const shared_stream &stream)
+void run_intake(const shared_stream &stream)
 {
-    LOG_NOTE("enter %s.\n", body);
+    LOG_NOTE("enter %s.\n", names_of(stream->kind).intake_body);
     unique_fd listener;
     if (vex_create_unix_server_socket(names_of(stream->kind).intake_path, &listener) == 0) {
         set_intake(*stream, intake_state::waiting);
@@ -152,14 +161,14 @@ void run_intake(const char *body, const shared_stream &stream)
 /* ---- The data link's thread ---- */
 
 /* Tells the server which stream of which device the link is for. */
-int announce(const char *body, log_kind kind, const log_link &link)
+int announce(log_kind kind, const log_link &link)
 {
     char text[kAnnouncementSize];
     log_print_announcement(text, "10", "DataLink", names_of(kind).connect_type);
     /* Nobody else sends on the link yet. */
     int result = log_send_pkg_msg(link.fd.get(), link.tls.get(), text, "", 0);
     for (int i = 1; result != 0 && i < kAnnounceMax; ++i) {
-        LOG_NOTE("%s :try send pkg msg \n", body);
+        LOG_NOTE("%s :try send pkg msg \n", names_of(kind).link_body);
         result = log_send_pkg_msg(link.fd.get(), link.tls.get(), text, "", 0);
     }
     return result;
@@ -293,10 +302,11 @@ void log_recv_server_msg(const shared_stream &stream, log_link &link)
 }
 
 /* Announces a link that has just been connected, and serves it. */
-void serve_link(const char *body, const shared_stream &stream, const std::shared_ptr<log_link> &link)
+void serve_link(const shared_stream &stream, const std::shared_ptr<log_link> &link)
 {
+    const char *const body = names_of(stream->kind).link_body;
     const bool wanted = record_connected(*stream, link);
-    const int announced = wanted ? announce(body, stream->kind, *link) : -1;
+    const int announced = wanted ? announce(stream->kind, *link) : -1;
     if (wanted && stream->kind == log_kind::syslog)
         LOG_NOTE("g_sock_fd.syslog_ssl = [%p]\n", static_cast<void *>(link->tls.get()));
     if (announced == 0 && record_announced(*stream)) {
@@ -323,83 +333,50 @@ void end_thread(const shared_stream &stream)
     count_at_work(-1);
 }
 
-void run_link(const char *body, const shared_stream &stream)
+void run_link(const shared_stream &stream)
 {
-    LOG_NOTE("enter %s.\n", body);
+    LOG_NOTE("enter %s.\n", names_of(stream->kind).link_body);
     std::unique_ptr<log_tls_session> session;
     unique_fd fd{log_connect_server(stream->target.ip, stream->target.port, &session, stream->stop.get())};
     if (fd) {
         if (const auto link = log_make_shared<log_link>(std::move(fd), std::move(session)))
-            serve_link(body, stream, link);
+            serve_link(stream, link);
     }
     end_thread(stream);
 }
 
 /* ---- Their starts ---- */
 
-void *log_recv_syslog_thread_proc(void *stream)
+void *intake_thread_proc(void *stream)
 {
-    run_intake(__func__, log_take_share<log_stream>(stream));
+    run_intake(log_take_share<log_stream>(stream));
     return nullptr;
 }
 
-void *log_recv_qxdm_thread_proc(void *stream)
+void *link_thread_proc(void *stream)
 {
-    run_intake(__func__, log_take_share<log_stream>(stream));
+    run_link(log_take_share<log_stream>(stream));
     return nullptr;
 }
 
-void *log_client_syslog_thread_proc(void *stream)
-{
-    run_link(__func__, log_take_share<log_stream>(stream));
-    return nullptr;
-}
-
-void *log_client_qxdm_thread_proc(void *stream)
-{
-    run_link(__func__, log_take_share<log_stream>(stream));
-    return nullptr;
-}
-
-/* Starts a thread that has a share in the stream; 0, or -1 (logged). */
-int start_thread(const char *starter, void *(*body)(void *), const shared_stream &stream)
+/* Starts a thread that has a share in the stream; false when it cannot be (logged). */
+bool start_thread(const char *starter, void *(*body)(void *), const shared_stream &stream)
 {
     void *const share = log_give_share(stream);
     if (share != nullptr && log_start_thread(starter, body, share) == 0)
-        return 0;
+        return true;
     if (share != nullptr)
         log_take_share<log_stream>(share);
     else
         LOG_NOTE("%s  FAIL\n", starter);
-    return -1;
-}
-
-int vex_log_recv_syslog_thread(const shared_stream &stream)
-{
-    return start_thread(__func__, log_recv_syslog_thread_proc, stream);
-}
-
-int vex_log_recv_qxdm_thread(const shared_stream &stream)
-{
-    return start_thread(__func__, log_recv_qxdm_thread_proc, stream);
-}
-
-int vex_log_client_syslog_thread(const shared_stream &stream)
-{
-    return start_thread(__func__, log_client_syslog_thread_proc, stream);
-}
-
-int vex_log_client_qxdm_thread(const shared_stream &stream)
-{
-    return start_thread(__func__, log_client_qxdm_thread_proc, stream);
+    return false;
 }
 
 /* Starts the intake and waits until it listens, or cannot: the server may confirm the link as soon as it is there. */
 void start_intake(const shared_stream &stream)
 {
     set_intake(*stream, intake_state::starting);
-    const bool syslog = stream->kind == log_kind::syslog;
-    if ((syslog ? vex_log_recv_syslog_thread(stream) : vex_log_recv_qxdm_thread(stream)) != 0)
+    if (!start_thread(names_of(stream->kind).intake_starter, intake_thread_proc, stream))
         set_intake(*stream, intake_state::over);
     const log_lock hold{g_registry_lock};
     while (stream->intake == intake_state::starting)
@@ -409,8 +386,7 @@ void start_intake(const shared_stream &stream)
 void start_link(const shared_stream &stream)
 {
     count_at_work(+1);
-    const bool syslog = stream->kind == log_kind::syslog;
-    if ((syslog ? vex_log_client_syslog_thread(stream) : vex_log_client_qxdm_thread(stream)) != 0)
+    if (!start_thread(names_of(stream->kind).link_starter, link_thread_proc, stream))
         end_thread(stream);
 }
 
@@ -430,25 +406,31 @@ bool has_program(const shared_stream &stream)
     return stream && stream->intake == intake_state::taken;
 }
 
-/* The socket that the stream's log program is to write to: over TLS, one that is connected to the stream's intake, of
- * which the stream keeps our end; else the data link; -1 when there is none (logged). */
-int program_socket(log_kind kind, const shared_stream &stream)
+/* What a log program is told to write to. */
+struct program_socket {
+    int fd = -1;
+    std::shared_ptr<const void> owner; /* keeps it open until the program has it */
+};
+
+/* Over TLS, a socket that is connected to the stream's intake, and is kept by the stream; else the data link; none when
+ * there is none (logged). */
+program_socket socket_for_program(log_kind kind, const shared_stream &stream)
 {
     if (g_daemon.use_ssl != 1) {
         const log_lock hold{g_registry_lock};
-        return stream && stream->link ? stream->link->fd.get() : -1;
+        return stream && stream->link ? program_socket{stream->link->fd.get(), stream->link} : program_socket{};
     }
-    unique_fd local{log_connect_unix_socket(names_of(kind).intake_path)};
-    if (!local)
-        return -1;
+    const auto local = log_make_shared<unique_fd>(log_connect_unix_socket(names_of(kind).intake_path));
+    if (!local || !*local)
+        return {};
     const log_lock hold{g_registry_lock};
     if (!stream || stream->ended)
-        return -1;
-    stream->local = std::move(local);
+        return {};
+    stream->local = local;
     if (stream->intake == intake_state::waiting)
         stream->intake = intake_state::taken;
     publish(kind);
-    return stream->local.get();
+    return {local->get(), local};
 }
 
 /* One change of a log's program for the stream, which may be none; nothing when it has ended meanwhile. */
@@ -465,10 +447,10 @@ void confirm_syslog(const shared_stream &stream)
 {
     if (!stream)
         return;
-    const int fd = program_socket(log_kind::syslog, stream);
+    const program_socket socket = socket_for_program(log_kind::syslog, stream);
     std::optional<log_program_change> change;
-    if (fd != -1 && begin_change(log_kind::syslog, stream, change))
-        log_write_syslog_to(*change, fd);
+    if (socket.fd != -1 && begin_change(log_kind::syslog, stream, change))
+        log_write_syslog_to(*change, socket.fd);
 }
 
 void confirm_modem(const shared_stream &stream)
@@ -476,23 +458,16 @@ void confirm_modem(const shared_stream &stream)
     std::optional<log_program_change> change;
     if (!begin_change(log_kind::qxdm, stream, change) || !log_prepare_modem_socket(*change))
         return;
-    const int fd = program_socket(log_kind::qxdm, stream);
-    if (fd != -1 || g_daemon.use_ssl != 1)
-        log_write_modem_to(*change, fd);
+    const program_socket socket = socket_for_program(log_kind::qxdm, stream);
+    if (socket.fd != -1 || g_daemon.use_ssl != 1)
+        log_write_modem_to(*change, socket.fd);
 }
 
 /* ---- The end of the process ---- */
 
-void *end_syslog_thread_proc(void *)
+void *end_thread_proc(void *kind)
 {
-    log_stream_end(log_kind::syslog);
-    count_at_work(-1);
-    return nullptr;
-}
-
-void *end_qxdm_thread_proc(void *)
-{
-    log_stream_end(log_kind::qxdm);
+    log_stream_end(*static_cast<const log_kind *>(kind));
     count_at_work(-1);
     return nullptr;
 }
@@ -592,11 +567,12 @@ void log_stream_disown_program(log_kind kind)
 void log_streams_end_all()
 {
     const auto end = log_clock::now() + kEndAllMax;
-    for (const log_kind kind : {log_kind::syslog, log_kind::qxdm}) {
+    static log_kind kinds[] = {log_kind::syslog, log_kind::qxdm};
+    for (log_kind &kind : kinds) {
         if (!is_streamed(kind))
             continue;
         count_at_work(+1);
-        if (log_start_thread(__func__, kind == log_kind::syslog ? end_syslog_thread_proc : end_qxdm_thread_proc) != 0)
+        if (log_start_thread(__func__, end_thread_proc, &kind) != 0)
             count_at_work(-1);
     }
     const log_lock hold{g_registry_lock};

@@ -4,12 +4,7 @@
 
 #include <cstring>
 
-namespace
-{
-
 constexpr char kLogSource[] = "log_tools";
-
-} // namespace
 
 int log_send_msg(int dst_module, int msg_cmd, const void *payload, int len)
 {

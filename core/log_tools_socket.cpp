@@ -11,12 +11,7 @@
 #include <sys/socket.h>
 #include <sys/un.h>
 
-namespace
-{
-
 constexpr char kLogSource[] = "log_tools";
-
-} // namespace
 
 void log_set_keepalive(int fd)
 {

@@ -9,12 +9,7 @@
 #include <cstring>
 #include <netinet/in.h>
 
-namespace
-{
-
 constexpr char kLogSource[] = "log_tools";
-
-} // namespace
 
 int log_text_to_int(const char *text)
 {

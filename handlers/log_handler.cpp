@@ -56,6 +56,14 @@ const char *log_member_text(const cJSON *object, const char *name, const char *w
     return text;
 }
 
+const char *log_member_told(const cJSON *object, const char *name, const char *what, const char *found)
+{
+    const char *const text = log_member_text(object, name, what);
+    if (text != nullptr)
+        LOG_NOTE(found, text);
+    return text;
+}
+
 const cJSON *log_member_object(const cJSON *object, const char *name, const char *what)
 {
     const cJSON *member = cJSON_GetObjectItem(object, name);

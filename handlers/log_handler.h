@@ -33,6 +33,9 @@ json_tree log_handler_take(const char *name, const char *control, const unsigned
 const char *log_member_text(const cJSON *object, const char *name, const char *what);
 const cJSON *log_member_object(const cJSON *object, const char *name, const char *what);
 
+/* A text as above, which is logged as `found`, a format, says. */
+const char *log_member_told(const cJSON *object, const char *name, const char *what, const char *found);
+
 /* Copies as much of a text as the field holds with its NUL. */
 template <std::size_t size> void log_keep_text(char (&field)[size], const char *text)
 {

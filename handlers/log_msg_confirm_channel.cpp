@@ -10,10 +10,9 @@ namespace
 /* Whether the server means this device. */
 bool is_for_this_device(const cJSON *link)
 {
-    const char *const imei = log_member_text(link, "imei", "K_Imei");
+    const char *const imei = log_member_told(link, "imei", "K_Imei", "imei = %s\n");
     if (imei == nullptr)
         return false;
-    LOG_NOTE("imei = %s\n", imei);
     char own[64] = {};
     vex_get_nv_item("imei", own, sizeof own);
     if (std::strcmp(imei, own) == 0)
@@ -33,11 +32,8 @@ int log_msg_confirm_channel(const char *control, const unsigned char *data, std:
     if (link == nullptr)
         return -1;
     const bool accepted = is_for_this_device(link);
-    const char *const type = log_member_text(link, "ConnectType", "K_ConnectType");
-    if (type == nullptr)
-        return -1;
-    LOG_NOTE("ConnectType = %s\n", type);
-    if (!accepted)
+    const char *const type = log_member_told(link, "ConnectType", "K_ConnectType", "ConnectType = %s\n");
+    if (type == nullptr || !accepted)
         return -1;
     if (std::strcmp(type, "syslog_connect") == 0) {
         log_stream_confirm(log_kind::syslog);

@@ -23,12 +23,8 @@ bool read_request(const cJSON *tree, bsp_request *request)
     const cJSON *bsp = log_member_object(tree, "bsp", "K_bspLogSet");
     if (bsp == nullptr)
         return false;
-    request->name = log_member_text(bsp, "module_name", "K_bspModuleName");
-    if (request->name != nullptr)
-        LOG_NOTE("bsp module_name = %s\n", request->name);
-    request->level = log_member_text(bsp, "level", "K_bspModuleLevel");
-    if (request->level != nullptr)
-        LOG_NOTE("bsp_reqmodulelevel = %s\n", request->level);
+    request->name = log_member_told(bsp, "module_name", "K_bspModuleName", "bsp module_name = %s\n");
+    request->level = log_member_told(bsp, "level", "K_bspModuleLevel", "bsp_reqmodulelevel = %s\n");
     return request->name != nullptr && request->level != nullptr;
 }
 

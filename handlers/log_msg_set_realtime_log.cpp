@@ -9,17 +9,13 @@ namespace
 /* Reads the server's address, which a request has in client mode only. */
 bool read_server(const cJSON *realtime, live_log_request *request)
 {
-    const char *const ip = log_member_text(realtime, "ip", "K_ip");
-    if (ip != nullptr) {
-        LOG_NOTE("server IP = [%s]\n", ip);
-        log_keep_text(request->ip, ip);
-    }
-    const char *const port = log_member_text(realtime, "port", "K_port");
-    if (port != nullptr) {
-        LOG_NOTE("server Port = [%s]\n", port);
-        log_keep_text(request->port, port);
-    }
-    return ip != nullptr && port != nullptr;
+    const char *const ip = log_member_told(realtime, "ip", "K_ip", "server IP = [%s]\n");
+    const char *const port = log_member_told(realtime, "port", "K_port", "server Port = [%s]\n");
+    if (ip == nullptr || port == nullptr)
+        return false;
+    log_keep_text(request->ip, ip);
+    log_keep_text(request->port, port);
+    return true;
 }
 
 /* Reads the request; false, after a log line, when it is not complete. */
@@ -28,18 +24,14 @@ bool read_request(const cJSON *tree, live_log_request *request)
     const cJSON *realtime = log_member_object(tree, "realtimeLog", "K_realtimeLog");
     if (realtime == nullptr)
         return false;
-    const char *const log_type = log_member_text(realtime, "LogType", "K_LogType");
-    if (log_type != nullptr) {
-        LOG_NOTE("LogType = %s\n", log_type);
-        log_keep_text(request->log_type, log_type);
-    }
-    const char *const action = log_member_text(realtime, "Action", "K_Action");
-    if (action != nullptr) {
-        LOG_NOTE("Action = %s\n", action);
-        log_keep_text(request->action, action);
-    }
+    const char *const log_type = log_member_told(realtime, "LogType", "K_LogType", "LogType = %s\n");
+    const char *const action = log_member_told(realtime, "Action", "K_Action", "Action = %s\n");
     const bool has_server = g_daemon.run_mode != 1 || read_server(realtime, request);
-    return log_type != nullptr && action != nullptr && has_server;
+    if (log_type == nullptr || action == nullptr || !has_server)
+        return false;
+    log_keep_text(request->log_type, log_type);
+    log_keep_text(request->action, action);
+    return true;
 }
 
 void reply(const live_log_answer &answer)

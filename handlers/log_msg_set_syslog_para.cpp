@@ -40,14 +40,10 @@ bool read_request(const cJSON *request, syslog_para *para)
     const cJSON *set = log_member_object(request, "syslogParaSet", "K_syslogParaSet");
     if (set == nullptr)
         return false;
-    const char *level = log_member_text(set, "sysloglevel", "K_sysloglevel");
-    if (level != nullptr)
-        LOG_NOTE("sysloglevel = %s\n", level);
-    const char *size = log_member_text(set, "syslogsize", "K_syslogsize");
-    if (size == nullptr)
-        return false;
-    LOG_NOTE("syslogsize = %s\n", size);
-    return level != nullptr && take(para->level, level, "sysloglevel") && take(para->size, size, "syslogsize");
+    const char *level = log_member_told(set, "sysloglevel", "K_sysloglevel", "sysloglevel = %s\n");
+    const char *size = log_member_told(set, "syslogsize", "K_syslogsize", "syslogsize = %s\n");
+    return level != nullptr && size != nullptr && take(para->level, level, "sysloglevel") &&
+           take(para->size, size, "syslogsize");
 }
 
 /* The local system log is started again with the values; while it is streamed, it is when the stream ends. */

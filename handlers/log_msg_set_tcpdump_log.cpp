@@ -23,12 +23,8 @@ bool read_request(const cJSON *request, capture_request *capture)
     const cJSON *tcpdump = log_member_object(request, "tcpdump", "K_tcpdump");
     if (tcpdump == nullptr)
         return false;
-    const char *interfaces = log_member_text(tcpdump, "InterfaceName", "K_InterfaceName");
-    if (interfaces != nullptr)
-        LOG_NOTE("InterfaceName = %s\n", interfaces);
-    const char *action = log_member_text(tcpdump, "Action", "K_Action");
-    if (action != nullptr)
-        LOG_NOTE("Action = %s\n", action);
+    const char *interfaces = log_member_told(tcpdump, "InterfaceName", "K_InterfaceName", "InterfaceName = %s\n");
+    const char *action = log_member_told(tcpdump, "Action", "K_Action", "Action = %s\n");
     /* The one member that may be missing without a word. */
     if (const char *length = cJSON_GetStringValue(cJSON_GetObjectItem(tcpdump, "TcpdumpLen")); length != nullptr) {
         LOG_NOTE("TcpdumpLen = %s\n", length);
