@@ -10,6 +10,8 @@
 #include "protocol/log_pkg_send.h"
 #include "protocol/log_recv.h"
 
+#include <sys/socket.h>
+
 namespace
 {
 
@@ -29,6 +31,7 @@ void announce(const log_link &link)
 void close_link(log_link &link)
 {
     vex_close_ssl(link.tls.get(), 1, log_clock::now() + kGoodByeMax);
+    shutdown(link.fd.get(), SHUT_RDWR); /* a handler that still runs may hold the link */
 }
 
 /* Serves the link until it ends; then it is closed. */

@@ -3,6 +3,7 @@
 #include "client/log_tls.h"
 #include "core/daemon_state.h"
 #include "core/log_line.h"
+#include "core/log_link.h"
 #include "core/log_tools.h"
 #include "platform/unique_fd.h"
 
@@ -85,12 +86,10 @@ void log_failure(const server_name &name)
     LOG_NOTE("fail connect to address: %s, port number: %d\n", name.address, name.port);
 }
 
-/* Waits until the connection is not wanted any more, for a time or, with -1, until `fd` can be written to. */
-bool stopped(int fd, int stop_fd, int milliseconds)
+/* Whether the connection is not wanted any more, also within a time. */
+bool is_stopped(int stop_fd, int milliseconds)
 {
-    pollfd entries[] = {{fd, POLLOUT, 0}, {stop_fd, POLLIN, 0}};
-    poll(entries, 2, milliseconds);
-    return entries[1].revents != 0;
+    return log_wait_ready(stop_fd, POLLIN, -1, milliseconds) != 0;
 }
 
 /* One try; 0, or the error. A call on a socket that is being connected tells what has come of it. */
@@ -99,7 +98,7 @@ int connect_once(int fd, const addrinfo &server, int stop_fd)
     while (connect(fd, server.ai_addr, server.ai_addrlen) != 0) {
         if (errno != EINPROGRESS && errno != EALREADY && errno != EINTR)
             return errno;
-        if (stopped(fd, stop_fd, -1))
+        if (log_wait_ready(fd, POLLOUT, stop_fd, -1) == 0)
             return ECANCELED;
     }
     return 0;
@@ -114,7 +113,7 @@ void set_non_blocking(int fd, bool on)
 /* Connects the socket; false, after the log lines, when no try succeeded. */
 bool try_to_connect(int fd, const addrinfo &server, const server_name &name, int stop_fd)
 {
-    for (int tries = 0; tries < g_daemon.retry_count && !stopped(-1, stop_fd, 0); ++tries) {
+    for (int tries = 0; tries < g_daemon.retry_count && !is_stopped(stop_fd, 0); ++tries) {
         const int error = connect_once(fd, server, stop_fd);
         if (error == 0)
             return true;
@@ -126,7 +125,7 @@ bool try_to_connect(int fd, const addrinfo &server, const server_name &name, int
         }
         if (!may_try_again(error))
             return false;
-        stopped(-1, stop_fd, kPause);
+        is_stopped(stop_fd, kPause);
     }
     log_failure(name);
     return false;

@@ -10,17 +10,20 @@
 #include "protocol/log_recv.h"
 #include "transport/log_intake.h"
 
+#include <atomic>
 #include <cstring>
 #include <optional>
+#include <span>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <utility>
 
 enum class intake_state {
-    none,     /* without TLS, and before it is started */
-    starting, /* its thread is */
-    waiting,  /* for the program */
-    taken,    /* a program was told to connect to it */
+    none,    /* without TLS */
+    idle,    /* until the link is connected */
+    opening, /* is asked to listen */
+    waiting, /* for the program */
+    taken,   /* a confirmation has its program connected to it */
     over,
 };
 
@@ -41,19 +44,28 @@ struct log_stream {
     std::shared_ptr<unique_fd> local LOG_GUARDED_BY(g_registry_lock);
     intake_state intake LOG_GUARDED_BY(g_registry_lock) = intake_state::none;
     bool announced LOG_GUARDED_BY(g_registry_lock) = false;
-    bool ended LOG_GUARDED_BY(g_registry_lock) = false;       /* by whoever was first */
+    bool drains LOG_GUARDED_BY(g_registry_lock) = false;      /* its program has been ended: the intake ends, too */
     bool owns_program LOG_GUARDED_BY(g_registry_lock) = true; /* the program that runs, if any, is for this stream */
+    std::atomic<bool> ended{false}; /* by whoever was first; is set while g_registry_lock is held */
 };
 
 namespace
 {
 
 constexpr char kLogSource[] = "vex_log_manage";
+constexpr char kConfirmSource[] = "log_json_codec"; /* of the confirmation's handler */
 
-constexpr int kAnnounceMax = 3;                      /* sends of the announcement until one succeeds */
-constexpr int kUnreadMax = 100;                      /* pieces that are thrown away when a link is closed */
-constexpr auto kDrainMax = std::chrono::seconds(2);  /* for what is on its way when a stream is stopped */
-constexpr auto kEndAllMax = std::chrono::seconds(5); /* for all of it at the end of the process */
+constexpr std::size_t kLinks = 0;
+constexpr std::size_t kEnds = 1;
+
+constexpr int kAnnounceMax = 3; /* sends of the announcement until one succeeds */
+constexpr int kUnreadMax = 100; /* pieces that are thrown away when a link is closed */
+/* For what is on its way when a stream is stopped; at the end of it the intake sends no more. */
+constexpr auto kDrainMax = std::chrono::milliseconds(2000);
+constexpr auto kGoodByeMax = std::chrono::milliseconds(500);
+/* For the ends of both streams at the end of the process; then for their links alone. */
+constexpr auto kEndAllMax = std::chrono::milliseconds(5000);
+constexpr auto kLinksEndMax = std::chrono::milliseconds(2500);
 
 using shared_stream = std::shared_ptr<log_stream>;
 
@@ -81,8 +93,9 @@ constexpr stream_names kNames[] = {
 };
 
 shared_stream g_current[2] LOG_GUARDED_BY(g_registry_lock);
-int g_at_work LOG_GUARDED_BY(g_registry_lock); /* links' threads, and ends of streams at the end of the process */
-std::condition_variable g_change;              /* of an intake's state, or of those at work */
+log_mutex g_intake_lock LOG_ACQUIRED_BEFORE(g_registry_lock); /* one intake at a time is put at its path */
+int g_threads[2] LOG_GUARDED_BY(g_registry_lock);             /* of links; that end a stream as the process ends */
+std::condition_variable g_change;                             /* of an intake, of a stream's end, of those counts */
 
 const stream_names &names_of(log_kind kind)
 {
@@ -123,6 +136,7 @@ void wake(const shared_stream &stream)
         link = stream->link;
         stream->local.reset();
     }
+    g_change.notify_all();
     if (link)
         log_link_take_away(*link);
 }
@@ -136,25 +150,38 @@ void set_intake(log_stream &stream, intake_state state)
     g_change.notify_all();
 }
 
-void count_at_work(int change)
+void count(std::size_t which, int change)
 {
     {
         const log_lock hold{g_registry_lock};
-        g_at_work += change;
+        g_threads[which] += change;
     }
     g_change.notify_all();
 }
 
 /* ---- The intake's thread ---- */
 
+/* Waits until the stream's link is connected: the path still belongs to an older stream until then. Puts the intake
+ * there, but never for a stream that has ended. */
+unique_fd open_intake(log_stream &stream)
+{
+    {
+        const log_lock hold{g_registry_lock};
+        while (stream.intake == intake_state::idle && !stream.ended)
+            g_registry_lock.wait(g_change);
+    }
+    const log_lock hold{g_intake_lock};
+    unique_fd listener;
+    if (!stream.ended && vex_create_unix_server_socket(names_of(stream.kind).intake_path, &listener) == 0)
+        set_intake(stream, intake_state::waiting);
+    return listener;
+}
+
 void run_intake(const shared_stream &stream)
 {
     LOG_NOTE("enter %s.\n", names_of(stream->kind).intake_body);
-    unique_fd listener;
-    if (vex_create_unix_server_socket(names_of(stream->kind).intake_path, &listener) == 0) {
-        set_intake(*stream, intake_state::waiting);
+    if (unique_fd listener = open_intake(*stream))
         log_server_handle_realtimelog(std::move(listener), static_cast<int>(stream->kind), stream->stop.get(), *stream);
-    }
     set_intake(*stream, intake_state::over);
 }
 
@@ -185,6 +212,21 @@ bool record_connected(log_stream &stream, const std::shared_ptr<log_link> &link)
     return true;
 }
 
+/* Waits until the intake listens, or cannot: the server may confirm the link as soon as it is announced. */
+void await_open_intake(log_stream &stream)
+{
+    {
+        const log_lock hold{g_registry_lock};
+        if (stream.intake != intake_state::idle)
+            return;
+        stream.intake = intake_state::opening;
+    }
+    g_change.notify_all();
+    const log_lock hold{g_registry_lock};
+    while (stream.intake == intake_state::opening)
+        g_registry_lock.wait(g_change);
+}
+
 /* Records that the link has been announced, and takes over from the stream before; false when this one has ended. */
 bool record_announced(log_stream &stream)
 {
@@ -203,11 +245,11 @@ bool record_announced(log_stream &stream)
     return true;
 }
 
-/* Waits until the intake has passed on what its program wrote before it was ended. */
+/* Where its program was ended, waits until the intake has passed on what it wrote before. */
 void await_intake(const log_stream &stream, log_clock::time_point end)
 {
     const log_lock hold{g_registry_lock};
-    while (stream.intake > intake_state::none && stream.intake < intake_state::over && log_clock::now() < end)
+    while (stream.drains && stream.intake == intake_state::taken && log_clock::now() < end)
         g_registry_lock.wait_until(g_change, end);
 }
 
@@ -227,7 +269,6 @@ void log_locally(log_kind kind, log_program_change &change)
     if (kind == log_kind::syslog) {
         log_restart_local_syslog(change, log_read_syslog_items(32));
     } else {
-        change.settle();
         change.end_by("diag_mdlog -k ");
     }
 }
@@ -257,17 +298,17 @@ void end_link(const shared_stream &stream, log_link &link)
     bool by_itself = false;
     {
         const log_lock hold{g_registry_lock};
-        by_itself = !std::exchange(stream->ended, true);
+        by_itself = !stream->ended.exchange(true);
         if (by_itself)
             give_way(*stream);
         if (by_itself && stream->owns_program)
             change.emplace(stream->kind);
     }
-    const auto end = log_clock::now() + (by_itself ? std::chrono::seconds(0) : kDrainMax);
+    const auto end = log_clock::now() + (by_itself ? std::chrono::milliseconds(0) : kDrainMax);
     if (by_itself)
         wake(stream);
     else
-        await_intake(*stream, end);
+        await_intake(*stream, end - kGoodByeMax);
     forget_link(*stream);
     close_link(link, end);
     if (change)
@@ -278,7 +319,7 @@ void take_piece(log_link &link, log_reassembly &state, std::span<const unsigned 
 {
     constexpr char kName[] = "log_recv_server_msg";
     if (link.taken) {
-        LOG_NOTE("%s: the stream was stopped or started again, what fd[%d] brought is dropped\n", kName, link.fd.get());
+        LOG_NOTE("%s: the stream was stopped or started anew, what fd[%d] brought is dropped\n", kName, link.fd.get());
         return;
     }
     LOG_NOTE("%s:recvbuf=%.*s\n", kName, static_cast<int>(piece.size()), reinterpret_cast<const char *>(piece.data()));
@@ -306,6 +347,8 @@ void serve_link(const shared_stream &stream, const std::shared_ptr<log_link> &li
 {
     const char *const body = names_of(stream->kind).link_body;
     const bool wanted = record_connected(*stream, link);
+    if (wanted)
+        await_open_intake(*stream);
     const int announced = wanted ? announce(stream->kind, *link) : -1;
     if (wanted && stream->kind == log_kind::syslog)
         LOG_NOTE("g_sock_fd.syslog_ssl = [%p]\n", static_cast<void *>(link->tls.get()));
@@ -316,7 +359,7 @@ void serve_link(const shared_stream &stream, const std::shared_ptr<log_link> &li
     if (wanted && announced != 0)
         LOG_NOTE("%s :close(%d) syslog connect \n", body, link->fd.get());
     else
-        LOG_NOTE("%s: the stream was stopped or started again, close(%d)\n", body, link->fd.get());
+        LOG_NOTE("%s: the stream was stopped or started anew, close(%d)\n", body, link->fd.get());
     close_link(*link, log_clock::now());
 }
 
@@ -330,7 +373,7 @@ void end_thread(const shared_stream &stream)
         stream->before = nullptr;
     }
     wake(stream);
-    count_at_work(-1);
+    count(kLinks, -1);
 }
 
 void run_link(const shared_stream &stream)
@@ -372,20 +415,16 @@ bool start_thread(const char *starter, void *(*body)(void *), const shared_strea
     return false;
 }
 
-/* Starts the intake and waits until it listens, or cannot: the server may confirm the link as soon as it is there. */
 void start_intake(const shared_stream &stream)
 {
-    set_intake(*stream, intake_state::starting);
+    set_intake(*stream, intake_state::idle);
     if (!start_thread(names_of(stream->kind).intake_starter, intake_thread_proc, stream))
         set_intake(*stream, intake_state::over);
-    const log_lock hold{g_registry_lock};
-    while (stream->intake == intake_state::starting)
-        g_registry_lock.wait(g_change);
 }
 
 void start_link(const shared_stream &stream)
 {
-    count_at_work(+1);
+    count(kLinks, +1);
     if (!start_thread(names_of(stream->kind).link_starter, link_thread_proc, stream))
         end_thread(stream);
 }
@@ -400,10 +439,27 @@ shared_stream linked_stream(log_kind kind)
     return stream && stream->announced ? stream : nullptr;
 }
 
-bool has_program(const shared_stream &stream)
+/* Over TLS, has the intake taken by this confirmation: false when it was by one before, or a newer start has its own at
+ * the path by now. */
+bool take_intake(log_kind kind, const shared_stream &stream)
 {
     const log_lock hold{g_registry_lock};
-    return stream && stream->intake == intake_state::taken;
+    const shared_stream &newest = current(kind);
+    const bool moved =
+        newest && newest != stream && newest->intake >= intake_state::opening && newest->intake < intake_state::over;
+    if (stream && (moved || stream->intake == intake_state::taken))
+        return false;
+    if (stream && stream->intake == intake_state::waiting)
+        stream->intake = intake_state::taken;
+    return true;
+}
+
+/* No program was connected to it. */
+void give_back_intake(const shared_stream &stream)
+{
+    const log_lock hold{g_registry_lock};
+    if (stream && stream->intake == intake_state::taken)
+        stream->intake = intake_state::waiting;
 }
 
 /* What a log program is told to write to. */
@@ -427,10 +483,16 @@ program_socket socket_for_program(log_kind kind, const shared_stream &stream)
     if (!stream || stream->ended)
         return {};
     stream->local = local;
-    if (stream->intake == intake_state::waiting)
-        stream->intake = intake_state::taken;
     publish(kind);
     return {local->get(), local};
+}
+
+/* The program that the socket was for was not started: the intake ends. */
+void drop_local(const shared_stream &stream)
+{
+    const log_lock hold{g_registry_lock};
+    if (stream)
+        stream->local.reset();
 }
 
 /* One change of a log's program for the stream, which may be none; nothing when it has ended meanwhile. */
@@ -439,28 +501,37 @@ bool begin_change(log_kind kind, const shared_stream &stream, std::optional<log_
     const log_lock hold{g_registry_lock};
     if (stream && stream->ended)
         return false;
-    change.emplace(kind);
+    if (stream)
+        stream->owns_program = true;
+    change.emplace(kind, stream ? &stream->ended : nullptr);
     return true;
 }
 
-void confirm_syslog(const shared_stream &stream)
+/* Whether a program could be connected; also below. */
+bool confirm_syslog(const shared_stream &stream)
 {
     if (!stream)
-        return;
+        return false;
     const program_socket socket = socket_for_program(log_kind::syslog, stream);
+    if (socket.fd == -1)
+        return false;
     std::optional<log_program_change> change;
-    if (socket.fd != -1 && begin_change(log_kind::syslog, stream, change))
-        log_write_syslog_to(*change, socket.fd);
+    if (!begin_change(log_kind::syslog, stream, change) || !log_write_syslog_to(*change, socket.fd))
+        drop_local(stream);
+    return true;
 }
 
-void confirm_modem(const shared_stream &stream)
+bool confirm_modem(const shared_stream &stream)
 {
     std::optional<log_program_change> change;
     if (!begin_change(log_kind::qxdm, stream, change) || !log_prepare_modem_socket(*change))
-        return;
+        return false;
     const program_socket socket = socket_for_program(log_kind::qxdm, stream);
-    if (socket.fd != -1 || g_daemon.use_ssl != 1)
-        log_write_modem_to(*change, socket.fd);
+    if (socket.fd == -1 && g_daemon.use_ssl == 1)
+        return false;
+    if (!log_write_modem_to(*change, socket.fd))
+        drop_local(stream);
+    return true;
 }
 
 /* ---- The end of the process ---- */
@@ -468,14 +539,23 @@ void confirm_modem(const shared_stream &stream)
 void *end_thread_proc(void *kind)
 {
     log_stream_end(*static_cast<const log_kind *>(kind));
-    count_at_work(-1);
+    count(kEnds, -1);
     return nullptr;
 }
 
-bool is_streamed(log_kind kind)
+/* Ends the stream behind, with the one before it; the two, or none. */
+void end_behind(log_kind &kind, std::span<shared_stream, 2> streams)
 {
-    const log_lock hold{g_registry_lock};
-    return current(kind) != nullptr;
+    {
+        const log_lock hold{g_registry_lock};
+        streams[0] = current(kind);
+        streams[1] = streams[0] ? streams[0]->before : nullptr;
+    }
+    if (!streams[0])
+        return;
+    count(kEnds, +1);
+    if (log_start_thread("log_streams_end_all", end_thread_proc, &kind) != 0)
+        count(kEnds, -1);
 }
 
 } // namespace
@@ -511,37 +591,37 @@ void log_stream_confirm(log_kind kind)
 {
     const shared_stream stream = linked_stream(kind);
     if (log_served() != nullptr && log_served()->taken)
-        LOG_NOTE("the data link was stopped before it was confirmed\n");
-    else if (has_program(stream))
-        LOG_NOTE("the data link has been confirmed before and its program writes, refused\n");
-    else if (kind == log_kind::syslog)
-        confirm_syslog(stream);
-    else
-        confirm_modem(stream);
+        LOG_NOTE_AS(kConfirmSource, "the data link was stopped before it was confirmed\n");
+    else if (!take_intake(kind, stream))
+        LOG_NOTE_AS(kConfirmSource, "the data link has been confirmed before, refused\n");
+    else if (!(kind == log_kind::syslog ? confirm_syslog(stream) : confirm_modem(stream)))
+        give_back_intake(stream);
 }
 
 void log_stream_end(log_kind kind)
 {
     shared_stream newest;
     shared_stream before;
+    bool is_announced = false;
     std::optional<log_program_change> change;
     {
         const log_lock hold{g_registry_lock};
         newest = std::exchange(current(kind), nullptr);
         if (newest) {
-            newest->ended = true;
+            is_announced = newest->announced;
             before = std::exchange(newest->before, nullptr);
         }
-        if (before)
-            before->ended = true;
+        for (const shared_stream &stream : {newest, before})
+            if (stream)
+                stream->ended = stream->drains = true;
         change.emplace(kind);
     }
-    if (kind == log_kind::syslog) {
+    if (!is_announced)
+        wake(newest); /* nothing is on its way there */
+    if (kind == log_kind::syslog)
         log_end_syslog(*change);
-    } else {
-        change->settle();
+    else
         change->end_by("diag_mdlog -k");
-    }
     {
         const log_lock hold{g_registry_lock};
         publish(kind);
@@ -554,29 +634,34 @@ void log_stream_end(log_kind kind)
     }
 }
 
-void log_stream_disown_program(log_kind kind)
+void log_stream_own_program(log_kind kind, bool owns)
 {
     const log_lock hold{g_registry_lock};
     if (const shared_stream stream = current(kind)) {
-        stream->owns_program = false;
+        stream->owns_program = owns;
         if (stream->before)
-            stream->before->owns_program = false;
+            stream->before->owns_program = owns;
     }
 }
 
 void log_streams_end_all()
 {
-    const auto end = log_clock::now() + kEndAllMax;
     static log_kind kinds[] = {log_kind::syslog, log_kind::qxdm};
-    for (log_kind &kind : kinds) {
-        if (!is_streamed(kind))
-            continue;
-        count_at_work(+1);
-        if (log_start_thread(__func__, end_thread_proc, &kind) != 0)
-            count_at_work(-1);
+    shared_stream streams[2][2];
+    for (std::size_t i = 0; i < 2; ++i)
+        end_behind(kinds[i], streams[i]);
+    {
+        const auto end = log_clock::now() + kEndAllMax;
+        const log_lock hold{g_registry_lock};
+        while (g_threads[kLinks] + g_threads[kEnds] > 0 && log_clock::now() < end)
+            g_registry_lock.wait_until(g_change, end);
     }
+    for (const auto &pair : streams)
+        for (const shared_stream &stream : pair)
+            wake(stream); /* its program hangs: the link ends without it */
+    const auto end = log_clock::now() + kLinksEndMax;
     const log_lock hold{g_registry_lock};
-    while (g_at_work > 0 && log_clock::now() < end)
+    while (g_threads[kLinks] > 0 && log_clock::now() < end)
         g_registry_lock.wait_until(g_change, end);
 }
 

@@ -3,7 +3,7 @@
  * thread: its target, its data link, over TLS its intake, and our end of its program's connection.
  *
  *     control link           data link's thread              intake's thread (over TLS)
- *     log_stream_start() --> connects, announces the link    listens, waits for the program
+ *     log_stream_start() --> connects, announces the link    listens by then, waits for the program
  *                            reads; the confirmation:
  *                            log_stream_confirm()        --> the program writes, pieces go out on the link
  *     log_stream_end()   --> drains, says good-bye, closes   ends with its program
@@ -16,21 +16,23 @@
 
 #include "core/log_programs.h"
 
-/* Starts a stream to the address: its threads run when this returns, and its intake listens. What fails is logged. */
+/* Starts a stream to the address: its threads run when this returns. What fails is logged. */
 void log_stream_start(log_kind kind, const char *ip, int port);
 
 /* Has the stream's log program started, which the server asks for on the data link: writing to the link itself or, over
- * TLS, to the intake. Not when the link that brought the confirmation has been stopped, nor over TLS a second time while
- * a program writes (both logged). */
+ * TLS, to the intake. Not when the link that brought the confirmation has been stopped, nor over TLS a second time, as an
+ * intake serves one program (both logged). */
 void log_stream_confirm(log_kind kind);
 
 /* Ends the stream and its program, and has the device log locally again. The link is closed by its own thread. */
 void log_stream_end(log_kind kind);
 
-/* The log's program was started again, without a link: when the link ends, the program is left alone. */
-void log_stream_disown_program(log_kind kind);
+/* Whether the log's program, if one runs, is for the links that there are: when it is not, their ends leave it alone. It
+ * is again from the next confirmation on. */
+void log_stream_own_program(log_kind kind, bool owns);
 
-/* Ends both streams, as the process is about to, and waits for their links: 5 seconds at the most. */
+/* Ends both streams, as the process is about to, and waits for that: 5 seconds for all of it, then 2.5 for the links
+ * whose programs hang. */
 void log_streams_end_all();
 
 #endif

@@ -62,6 +62,10 @@ template <typename Type> std::shared_ptr<Type> log_take_share(void *argument)
     return std::move(*share);
 }
 
+/* Waits, -1 milliseconds: for ever, until `fd` has one of the events or `stop_fd`, where it is not -1, is readable; what
+ * `fd` has, 0 when it has none. Interrupted waits go on. */
+short log_wait_ready(int fd, short events, int stop_fd, int milliseconds);
+
 /* Hands over what `read` brings, piece by piece, until there is no more: then 0, or the errno of the read that failed. */
 template <typename Read, typename Take> int log_read_pieces(const Read &read, const Take &take)
 {

@@ -15,7 +15,7 @@ namespace
 
 constexpr char kLogSource[] = "log_json_codec";
 
-constexpr auto kEndMax = std::chrono::seconds(3); /* that a command that ends programs is waited for */
+constexpr auto kEndMax = std::chrono::seconds(3); /* for a command that ends programs */
 constexpr unsigned kModemStart = 2;               /* seconds until the modem's log program can be connected to */
 
 constexpr char kModemConfig[] = "/logfs/logconf/Diag.cfg"; /* without it there is no modem log */
@@ -25,8 +25,8 @@ constexpr char kUsbInterface[] = "/sys/class/net/usb0";
 struct program_state {
     log_mutex run_lock LOG_ACQUIRED_BEFORE(g_registry_lock);
     std::atomic<const log_program_change *> newest{nullptr};
-    pid_t child LOG_GUARDED_BY(run_lock) = -1; /* what the latest change has left behind */
-    int ending LOG_GUARDED_BY(run_lock) = 0;   /* commands that end programs are under way */
+    pid_t child LOG_GUARDED_BY(run_lock) = -1;    /* what was left behind */
+    bool ending LOG_GUARDED_BY(run_lock) = false; /* a command that ends programs is under way */
     std::condition_variable ended;
 };
 
@@ -37,9 +37,13 @@ program_state &state_of(log_kind kind)
     return g_programs[static_cast<std::size_t>(kind)];
 }
 
-bool has_second_config()
+/* Waits for what earlier changes have under way or left behind. */
+void settle(program_state &state) LOG_REQUIRES(state.run_lock)
 {
-    return access("/logfs/logconf//Diag.cfg2", F_OK) == 0;
+    while (state.ending)
+        state.run_lock.wait(state.ended);
+    if (const pid_t child = std::exchange(state.child, -1); child != -1)
+        log_end_child(child);
 }
 
 bool has_config()
@@ -64,30 +68,31 @@ void print_script(char (&cmd)[256], const log_syslog_items &items, const char *e
                   items.level, items.size, end);
 }
 
+/* The modem's log program with one configuration, or with two. `blanks` is what its line has in front of its counts. */
+void print_modem(char (&cmd)[256], const char *blanks, const char *to)
+{
+    if (access("/logfs/logconf//Diag.cfg2", F_OK) == 0)
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -m %s -o /tmp/diag_logs\t-n 2 -s 10 -R %s &", kModemConfig,
+                      kModemConfig2, to);
+    else
+        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs%s-n 2 -s 10 -R %s &", kModemConfig, blanks,
+                      to);
+}
+
 } // namespace
 
-log_program_change::log_program_change(log_kind kind) : kind_(kind)
+log_program_change::log_program_change(log_kind kind, const std::atomic<bool> *unwanted)
+    : kind_(kind), unwanted_(unwanted)
 {
     state_of(kind_).newest = this;
 }
 
-bool log_program_change::is_newest() const
+bool log_program_change::is_wanted() const
 {
-    if (state_of(kind_).newest == this)
+    if (state_of(kind_).newest == this && (unwanted_ == nullptr || !*unwanted_))
         return true;
-    LOG_NOTE("a newer start or end of this log has come, nothing is started\n");
+    LOG_NOTE("a newer start or end of this log has come, nothing more is done\n");
     return false;
-}
-
-void log_program_change::settle()
-{
-    program_state &state = state_of(kind_);
-    const auto end = log_clock::now() + kEndMax;
-    const log_lock hold{state.run_lock};
-    while (state.ending > 0 && log_clock::now() < end)
-        state.run_lock.wait_until(state.ended, end);
-    if (const pid_t child = std::exchange(state.child, -1); child != -1)
-        log_end_child(child);
 }
 
 void log_program_change::end_by(const char *cmd)
@@ -95,28 +100,34 @@ void log_program_change::end_by(const char *cmd)
     program_state &state = state_of(kind_);
     {
         const log_lock hold{state.run_lock};
-        ++state.ending;
+        settle(state);
+        if (!is_wanted())
+            return;
+        state.ending = true;
     }
-    log_exec_cmd(cmd);
+    const pid_t left = log_exec_cmd_within(cmd, kEndMax);
     {
         const log_lock hold{state.run_lock};
-        --state.ending;
+        state.ending = false;
+        state.child = left;
     }
     state.ended.notify_all();
 }
 
-void log_program_change::launch(const char *cmd, int handed_fd)
+bool log_program_change::launch(const char *cmd, int handed_fd)
 {
-    const log_lock hold{state_of(kind_).run_lock};
-    if (is_newest())
-        log_exec_cmd_with(cmd, handed_fd);
+    program_state &state = state_of(kind_);
+    const log_lock hold{state.run_lock};
+    settle(state);
+    return is_wanted() && log_exec_cmd_with(cmd, handed_fd) == 0;
 }
 
 void log_program_change::launch_behind(const char *cmd)
 {
     program_state &state = state_of(kind_);
     const log_lock hold{state.run_lock};
-    if (is_newest())
+    settle(state);
+    if (is_wanted())
         state.child = log_exec_cmd_behind(cmd);
 }
 
@@ -151,13 +162,11 @@ void log_restart_local_syslog(log_program_change &change, const log_syslog_items
 {
     char cmd[256];
     print_script(cmd, items, "&");
-    change.settle();
     change.launch_behind(cmd);
 }
 
 void log_end_syslog(log_program_change &change)
 {
-    change.settle();
     change.end_by("killall -9 syslogd");
 }
 
@@ -169,13 +178,13 @@ void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_
     change.launch(cmd);
 }
 
-void log_write_syslog_to(log_program_change &change, int fd)
+bool log_write_syslog_to(log_program_change &change, int fd)
 {
     char cmd[256];
     std::snprintf(cmd, sizeof cmd, "syslogd -R tcp_fd=%d &", fd);
     LOG_NOTE("cmd=[%s]\n", cmd);
     log_end_syslog(change);
-    change.launch(cmd, fd);
+    return change.launch(cmd, fd);
 }
 
 int log_syslog_size_max()
@@ -191,7 +200,6 @@ int log_syslog_size_max()
 
 log_modem_start log_prepare_modem(log_program_change &change)
 {
-    change.settle();
     change.end_by("killall -9 diag_mdlog");
     change.end_by("killall -9 diag_socket_log");
     if (!has_config())
@@ -212,19 +220,15 @@ log_modem_start log_prepare_modem(log_program_change &change)
 void log_offer_modem_at(log_program_change &change, const char *ip)
 {
     char cmd[256];
-    if (has_second_config())
-        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -m %s -o /tmp/diag_logs\t-n 2 -s 10 -R %s -P %d &",
-                      kModemConfig, kModemConfig2, ip, kLogModemPort);
-    else
-        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs  -n 2 -s 10 -R %s -P %d &", kModemConfig, ip,
-                      kLogModemPort);
+    char to[64];
+    std::snprintf(to, sizeof to, "%s -P %d", ip, kLogModemPort);
+    print_modem(cmd, "  ", to);
     change.launch(cmd);
     sleep(kModemStart);
 }
 
 bool log_prepare_modem_socket(log_program_change &change)
 {
-    change.settle();
     change.end_by("killall -9 diag_mdlog");
     if (!has_config())
         return false;
@@ -233,14 +237,11 @@ bool log_prepare_modem_socket(log_program_change &change)
     return true;
 }
 
-void log_write_modem_to(log_program_change &change, int fd)
+bool log_write_modem_to(log_program_change &change, int fd)
 {
     char cmd[256];
-    if (has_second_config())
-        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -m %s -o /tmp/diag_logs\t-n 2 -s 10 -R tcp_fd=%d &",
-                      kModemConfig, kModemConfig2, fd);
-    else
-        std::snprintf(cmd, sizeof cmd, "diag_mdlog -f %s -o /tmp/diag_logs -n 2 -s 10 -R tcp_fd=%d &", kModemConfig,
-                      fd);
-    change.launch(cmd, fd);
+    char to[32];
+    std::snprintf(to, sizeof to, "tcp_fd=%d", fd);
+    print_modem(cmd, " ", to);
+    return change.launch(cmd, fd);
 }

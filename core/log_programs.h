@@ -2,9 +2,9 @@
  * What writes the device's two logs: every command line that starts or ends syslogd, diag_mdlog and the system log's
  * script, in both of the daemon's modes.
  *
- * Programs are changed by several threads, and a change takes a while. The newest one wins: an older one that has not
- * started its program yet does not start it any more. Programs are ended without a lock, before others are started, so
- * that one that hangs holds up nobody for long.
+ * Programs are changed by several threads, and a change takes a while. The newest one wins: an older one does nothing
+ * more once a newer one has come. Before a change does anything, it ends what the ones before have left under way, so
+ * that a program that hangs holds up nobody for long.
  */
 #ifndef CORE_LOG_PROGRAMS_H
 #define CORE_LOG_PROGRAMS_H
@@ -12,6 +12,7 @@
 #include "core/log_lock.h"
 #include "core/log_registry.h"
 
+#include <atomic>
 #include <sys/types.h>
 
 enum class log_kind {
@@ -23,31 +24,34 @@ enum class log_kind {
 class log_program_change
 {
 public:
-    /* From here on it is the newest one. */
-    explicit log_program_change(log_kind kind);
+    /* From here on it is the newest one. It is wanted until a newer one has come or `*unwanted`, where there is one, is
+     * set. */
+    explicit log_program_change(log_kind kind, const std::atomic<bool> *unwanted = nullptr);
     log_program_change(const log_program_change &) = delete;
     log_program_change &operator=(const log_program_change &) = delete;
 
-    /* Waits for what earlier changes have left under way: 3 seconds for their commands that end programs, then for a
-     * restart of the local system log as long as log_end_child() gives it. */
-    void settle();
+    /* Each of these first waits for what is under way: for a command that ends programs, then for a program that was
+     * left behind, as long as log_end_child() gives it. It does nothing when the change is not wanted any more, which
+     * is logged. */
 
-    /* Runs a command that ends programs. */
+    /* Runs a command that ends programs; one that hangs is left behind after 3 seconds. */
     void end_by(const char *cmd);
 
-    /* Starts a program, which inherits `handed_fd` where that is not -1; or, behind, as a child that the next change
-     * waits for. Not when a newer change has come, which is logged. */
-    void launch(const char *cmd, int handed_fd = -1);
+    /* Starts a program, which inherits `handed_fd` where that is not -1; whether it did. */
+    bool launch(const char *cmd, int handed_fd = -1);
+
+    /* Starts a program that is left behind. */
     void launch_behind(const char *cmd);
 
 private:
-    bool is_newest() const;
+    bool is_wanted() const;
 
     const log_kind kind_;
+    const std::atomic<bool> *const unwanted_;
 };
 
-/* Ends a child that has been left behind by a change, when it has ended by itself: nobody else would learn of it before
- * the next change. For start-up's loop. */
+/* Forgets a program that was left behind and has ended by itself: nobody else would learn of it before the next change.
+ * For start-up's loop. */
 void log_reap_programs();
 
 /* ---- The system log ---- */
@@ -75,8 +79,8 @@ void log_end_syslog(log_program_change &change);
 constexpr int kLogSyslogPort = 1514; /* on the log tool */
 void log_send_syslog_to_tool(log_program_change &change, const char *ip, int ip_class);
 
-/* Has the system log written to a socket. */
-void log_write_syslog_to(log_program_change &change, int fd);
+/* Has the system log written to a socket; false when its program was not started. */
+bool log_write_syslog_to(log_program_change &change, int fd);
 
 /* Size of the partition that the NV item `syslog_path` lies on, in KB: the number that df shows for it in MB, times
  * 1024; 0 when df has no line for it. Runs df and waits for it. */
@@ -100,9 +104,9 @@ log_modem_start log_prepare_modem(log_program_change &change);
 /* Has the modem's log offered at the address, to whoever connects to it there. */
 void log_offer_modem_at(log_program_change &change, const char *ip);
 
-/* Makes ready to have the modem's log written to a socket, then has it written there. False, and nothing is to be
- * written, without a configuration (logged). */
+/* Makes ready to have the modem's log written to a socket: false without a configuration (logged). Then has it written
+ * there: false when its program was not started. */
 bool log_prepare_modem_socket(log_program_change &change);
-void log_write_modem_to(log_program_change &change, int fd);
+bool log_write_modem_to(log_program_change &change, int fd);
 
 #endif

@@ -8,6 +8,7 @@
 #ifndef CORE_LOG_TOOLS_H
 #define CORE_LOG_TOOLS_H
 
+#include <chrono>
 #include <cstdint>
 #include <pthread.h>
 #include <sys/types.h>
@@ -59,6 +60,10 @@ int log_exec_cmd_with(const char *cmdStr, int handed_fd);
 /* The same for a line that ends in "&" whose program is to be known: it is a child that is not waited for. Its number,
  * by which it must be asked for or ended one day; -1 when it could not be started. */
 pid_t log_exec_cmd_behind(const char *cmdStr);
+
+/* The same as log_exec_cmd() for one program that may hang, which is waited for so long at the most: -1, or its number
+ * when it is left behind (logged), as above. */
+pid_t log_exec_cmd_within(const char *cmdStr, std::chrono::seconds time);
 
 /* Whether such a child has ended; then it is forgotten and its number must not be used any more. */
 bool log_child_ended(pid_t child);

@@ -23,7 +23,7 @@ constexpr char kLogSource[] = "log_tools";
 constexpr auto kEndsMax = std::chrono::seconds(3);
 constexpr auto kTerminatesMax = std::chrono::seconds(2);
 constexpr auto kDiesMax = std::chrono::seconds(1);
-constexpr useconds_t kLookAgain = 10000; /* microseconds */
+constexpr useconds_t kLookAgain = 1000; /* microseconds */
 
 /* Starts a shell for the line. `handed_fd`: a descriptor that its programs inherit under its number; `output`: where
  * its standard output goes; -1 for neither. -1 on failure. */
@@ -31,6 +31,8 @@ pid_t start_shell(const char *line, int handed_fd, int output)
 {
     /* A copy is put in the number's place, which clears the mark that closes it, in the child only. */
     const unique_fd copy{handed_fd != -1 ? fcntl(handed_fd, F_DUPFD_CLOEXEC, 0) : -1};
+    if (handed_fd != -1 && !copy)
+        return -1;
     posix_spawn_file_actions_t actions;
     if (posix_spawn_file_actions_init(&actions) != 0)
         return -1;
@@ -45,6 +47,14 @@ pid_t start_shell(const char *line, int handed_fd, int output)
         error = posix_spawn(&shell, "/bin/sh", &actions, nullptr, const_cast<char *const *>(words), environ);
     posix_spawn_file_actions_destroy(&actions);
     return error == 0 ? shell : -1;
+}
+
+/* Starts the program of a simple command line, in its shell's place. */
+pid_t start_program(const char *cmdStr, std::size_t len)
+{
+    char line[512];
+    std::snprintf(line, sizeof line, "exec %.*s", static_cast<int>(len), cmdStr);
+    return start_shell(line, -1, -1);
 }
 
 /* Waits for the shell; its status as system() has it. */
@@ -89,11 +99,11 @@ int read_line(int fd, char *buffer, int size)
     return held;
 }
 
-/* Whether the child ends in that time. Then it is forgotten. */
-bool ends_within(pid_t child, std::chrono::seconds time)
+/* Whether the child ends in that time. Then it is forgotten, and its status stored. */
+bool ends_within(pid_t child, std::chrono::seconds time, int *status = nullptr)
 {
     const auto end = log_clock::now() + time;
-    while (waitpid(child, nullptr, WNOHANG) == 0) {
+    while (waitpid(child, status, WNOHANG) == 0) {
         if (log_clock::now() >= end)
             return false;
         usleep(kLookAgain);
@@ -117,11 +127,22 @@ int log_exec_cmd_with(const char *cmdStr, int handed_fd)
 pid_t log_exec_cmd_behind(const char *cmdStr)
 {
     LOG_NOTE("cmdStr[%s]\n", cmdStr);
-    char line[512]; /* without the "&", and so that the program takes the shell's place */
-    std::snprintf(line, sizeof line, "exec %.*s", static_cast<int>(std::strlen(cmdStr)) - 1, cmdStr);
-    const pid_t child = start_shell(line, -1, -1);
+    const pid_t child = start_program(cmdStr, std::strlen(cmdStr) - 1); /* without the "&" */
     judge_cmd(cmdStr, child != -1 ? 0 : -1);
     return child;
+}
+
+pid_t log_exec_cmd_within(const char *cmdStr, std::chrono::seconds time)
+{
+    LOG_NOTE("cmdStr[%s]\n", cmdStr);
+    const pid_t child = start_program(cmdStr, std::strlen(cmdStr));
+    int status = -1;
+    if (child != -1 && !ends_within(child, time, &status)) {
+        LOG_FAULT("[%s] does not end, it is left behind\n", cmdStr);
+        return child;
+    }
+    judge_cmd(cmdStr, status);
+    return -1;
 }
 
 bool log_child_ended(pid_t child)

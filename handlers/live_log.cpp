@@ -90,7 +90,6 @@ live_log_answer start_modem(const stream_ends &ends)
 live_log_answer end_modem()
 {
     log_program_change change{log_kind::qxdm};
-    change.settle();
     change.end_by("killall -9 diag_mdlog");
     return answer("tcp", 0, "");
 }
@@ -105,15 +104,16 @@ live_log_answer open_link(log_kind kind, const live_log_request &request)
 
 live_log_answer start_modem_link(const live_log_request &request)
 {
+    log_stream_own_program(log_kind::qxdm, false); /* should the log go to USB, the end of a link leaves it alone */
+    std::optional<live_log_answer> other;
     {
         log_program_change change{log_kind::qxdm};
-        if (const auto other = prepare_modem(change)) {
-            if (std::strcmp(other->result, kSuccess) == 0)
-                log_stream_disown_program(log_kind::qxdm);
-            return *other;
-        }
+        other = prepare_modem(change);
     }
-    return open_link(log_kind::qxdm, request);
+    if (other && std::strcmp(other->result, kSuccess) == 0)
+        return *other;
+    log_stream_own_program(log_kind::qxdm, true);
+    return other ? *other : open_link(log_kind::qxdm, request);
 }
 
 live_log_answer close_link(log_kind kind)

@@ -11,23 +11,9 @@
 #include <unistd.h>
 #include <utility>
 
-namespace
-{
-
 constexpr char kLogSource[] = "vex_log_manage";
 
 constexpr int kBacklog = 1;
-
-/* Whether a program has come; else the intake is not wanted any more. */
-bool program_comes(int listener, int stop_fd)
-{
-    pollfd entries[] = {{listener, POLLIN, 0}, {stop_fd, POLLIN, 0}};
-    while (poll(entries, 2, -1) == -1 && errno == EINTR) {
-    }
-    return entries[0].revents != 0;
-}
-
-} // namespace
 
 int vex_create_unix_server_socket(const char *path, unique_fd *listener)
 {
@@ -61,7 +47,7 @@ int vex_create_unix_server_socket(const char *path, unique_fd *listener)
 void log_server_handle_realtimelog(unique_fd listener, int log_type, int stop_fd, log_stream &stream)
 {
     LOG_NOTE("%s enter ", __func__);
-    if (!program_comes(listener.get(), stop_fd)) {
+    if (log_wait_ready(listener.get(), POLLIN, stop_fd, -1) == 0) {
         LOG_NOTE("%s: log_type[%d] is not wanted any more\n", __func__, log_type);
         return;
     }
