@@ -64,7 +64,11 @@ void *log_client_ctl_thread_proc(void *)
     LOG_NOTE("enter %s.\n", __func__);
     serve_link();
     LOG_NOTE("vex_log_manage exit \n");
-    g_daemon.exit_flag = 1; /* last: the process may end before this thread does anything more */
+    {
+        const log_lock hold{g_daemon.exit_lock};
+        g_daemon.exit_flag = 1;
+    }
+    g_daemon.exit_change.notify_all(); /* last: the process may end before this thread does anything more */
     return nullptr;
 }
 

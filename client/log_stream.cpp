@@ -64,7 +64,7 @@ constexpr int kUnreadMax = 100; /* pieces that are thrown away when a link is cl
 constexpr auto kDrainMax = std::chrono::milliseconds(2000);
 constexpr auto kGoodByeMax = std::chrono::milliseconds(500);
 /* For the ends of both streams at the end of the process; then for their links alone. */
-constexpr auto kEndAllMax = std::chrono::milliseconds(5000);
+constexpr auto kEndAllMax = std::chrono::milliseconds(3500);
 constexpr auto kLinksEndMax = std::chrono::milliseconds(2500);
 
 using shared_stream = std::shared_ptr<log_stream>;

@@ -18,7 +18,10 @@ struct log_daemon_state {
     int use_ssl = 0;      /* 1 when client mode runs over TLS: every read and write chooses by it */
 
     std::atomic<int> syslog_realtime_on{0}; /* 1 while the system log is streamed instead of kept on the device */
-    std::atomic<int> exit_flag{0};          /* set to 1 to end the process; start-up looks at it every 5 seconds */
+
+    log_mutex exit_lock;
+    int exit_flag LOG_GUARDED_BY(exit_lock) = 0; /* set to 1 to end the process */
+    std::condition_variable exit_change;
 
     /* Bytes of the configuration package that have arrived since the last one was complete or the count was reset. It
      * outlives the connection: a tool that was cut off can go on where it stopped. 64 bits: more may arrive than was

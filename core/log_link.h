@@ -37,8 +37,17 @@ struct log_link {
 
     log_mutex sending; /* one frame at a time */
 
-    /* Its owner is to do nothing more for it but end it: see log_link_take_away(). */
+    /* Its owner must do nothing more for it but end it: see log_link_take_away(). */
     std::atomic<bool> taken{false};
+
+    /* Whether nobody has waited for what it asked for in the last 10 seconds, as its tool was replaced, or its server has
+     * hung up: what still runs for it is ended, and nothing more is run. For its owner. */
+    bool is_given_up();
+
+private:
+    bool is_lost() const;
+
+    log_clock::time_point lost_since_ = log_clock::time_point::max();
 };
 
 /* A shared object; null without memory. */

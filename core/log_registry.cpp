@@ -1,6 +1,7 @@
 #include "core/log_registry.h"
 
 #include "core/daemon_state.h"
+#include "core/log_line.h"
 
 #include <cstring>
 #include <sys/socket.h>
@@ -19,6 +20,12 @@ int qxdm_local_fd = -1;
 
 namespace
 {
+
+constexpr char kLogSource[] = "vex_log_manage";
+
+/* How long a turn is waited for at a time: whether the link is given up is looked at in between. */
+constexpr std::chrono::milliseconds kNoWait{0};
+constexpr std::chrono::milliseconds kLookAgain{500};
 
 std::shared_ptr<log_link> g_cmd_link LOG_GUARDED_BY(g_registry_lock); /* what cmd_fd and cmd_ssl belong to */
 bool g_turn_taken LOG_GUARDED_BY(g_registry_lock);
@@ -114,16 +121,34 @@ log_link *log_served()
     return t_served;
 }
 
+bool log_served_given_up()
+{
+    return t_served != nullptr && t_served->is_given_up();
+}
+
 log_cmd_turn::log_cmd_turn(bool alone) : alone_(alone)
 {
     if (!alone_) {
         granted_ = is_wanted();
         return;
     }
+    take(kNoWait);
+    if (granted_ || !is_wanted())
+        return;
+    LOG_NOTE("the command before is still at work, fd[%d] waits for it\n",
+             t_served != nullptr ? t_served->fd.get() : -1);
+    while (!granted_ && is_wanted() && !log_served_given_up())
+        take(kLookAgain);
+}
+
+/* Takes the turn when it is free, or becomes free in that time. */
+void log_cmd_turn::take(std::chrono::milliseconds time)
+{
+    const auto end = log_clock::now() + time;
     const log_lock hold{g_registry_lock};
-    while (g_turn_taken && is_wanted())
-        g_registry_lock.wait(g_turn_change);
-    granted_ = is_wanted();
+    while (g_turn_taken && is_wanted() && log_clock::now() < end)
+        g_registry_lock.wait_until(g_turn_change, end);
+    granted_ = !g_turn_taken && is_wanted();
     if (granted_)
         g_turn_taken = true;
 }

@@ -98,10 +98,13 @@ public:
 /* The link that the calling thread serves; null: none. */
 log_link *log_served();
 
+/* Whether that link is given up: see log_link::is_given_up(). */
+bool log_served_given_up();
+
 /*
  * A turn to run a command that does not run beside others. One thread has it at a time: a tool that took over from
- * another waits here until the other's command has ended. A thread whose link is taken away meanwhile waits no longer;
- * it gets no turn, nor does one whose link was taken away before.
+ * another waits here until the other's command has ended. A thread whose link is taken away or given up meanwhile waits
+ * no longer; it gets no turn, nor does one whose link was taken away before.
  */
 class log_cmd_turn
 {
@@ -113,6 +116,8 @@ public:
     bool granted() const { return granted_; }
 
 private:
+    void take(std::chrono::milliseconds time);
+
     const bool alone_;
     bool granted_ = false;
 };

@@ -1,7 +1,8 @@
 #include "core/log_tools.h"
 
 #include "core/log_line.h"
-#include "core/log_lock.h"
+#include "core/log_link.h"
+#include "core/log_registry.h"
 #include "platform/unique_fd.h"
 
 #include <algorithm>
@@ -10,7 +11,9 @@
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
+#include <poll.h>
 #include <spawn.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -25,27 +28,54 @@ constexpr auto kTerminatesMax = std::chrono::seconds(2);
 constexpr auto kDiesMax = std::chrono::seconds(1);
 constexpr useconds_t kLookAgain = 1000; /* microseconds */
 
+/* Milliseconds between two looks at whether somebody still waits for a shell. */
+constexpr int kStillWanted = 500;
+
+/* Whether it runs in the background of its shell. */
+bool is_behind(const char *cmdStr)
+{
+    const std::size_t len = std::strlen(cmdStr);
+    return len > 0 && cmdStr[len - 1] == '&';
+}
+
+/* What a shell is started with, piece by piece; `error` is the first that there was. */
+struct shell_start {
+    shell_start()
+    {
+        posix_spawn_file_actions_init(&actions); /* neither fails here */
+        posix_spawnattr_init(&attributes);
+    }
+    ~shell_start()
+    {
+        posix_spawn_file_actions_destroy(&actions);
+        posix_spawnattr_destroy(&attributes);
+    }
+    shell_start(const shell_start &) = delete;
+    shell_start &operator=(const shell_start &) = delete;
+
+    posix_spawn_file_actions_t actions;
+    posix_spawnattr_t attributes;
+};
+
 /* Starts a shell for the line. `handed_fd`: a descriptor that its programs inherit under its number; `output`: where
- * its standard output goes; -1 for neither. -1 on failure. */
-pid_t start_shell(const char *line, int handed_fd, int output)
+ * its standard output goes; -1 for neither. `alone`: with its programs, in a process group of its own. -1 on failure. */
+pid_t start_shell(const char *line, bool alone, int handed_fd = -1, int output = -1)
 {
     /* A copy is put in the number's place, which clears the mark that closes it, in the child only. */
     const unique_fd copy{handed_fd != -1 ? fcntl(handed_fd, F_DUPFD_CLOEXEC, 0) : -1};
     if (handed_fd != -1 && !copy)
         return -1;
-    posix_spawn_file_actions_t actions;
-    if (posix_spawn_file_actions_init(&actions) != 0)
-        return -1;
-    int error = 0;
-    if (copy)
-        error = posix_spawn_file_actions_adddup2(&actions, copy.get(), handed_fd);
+    shell_start start;
+    int error = posix_spawnattr_setflags(&start.attributes, alone ? POSIX_SPAWN_SETPGROUP : 0);
+    if (error == 0 && copy)
+        error = posix_spawn_file_actions_adddup2(&start.actions, copy.get(), handed_fd);
     if (error == 0 && output != -1)
-        error = posix_spawn_file_actions_adddup2(&actions, output, STDOUT_FILENO);
+        error = posix_spawn_file_actions_adddup2(&start.actions, output, STDOUT_FILENO);
     const char *const words[] = {"sh", "-c", line, nullptr};
     pid_t shell = -1;
     if (error == 0)
-        error = posix_spawn(&shell, "/bin/sh", &actions, nullptr, const_cast<char *const *>(words), environ);
-    posix_spawn_file_actions_destroy(&actions);
+        error = posix_spawn(&shell, "/bin/sh", &start.actions, &start.attributes, const_cast<char *const *>(words),
+                            environ);
     return error == 0 ? shell : -1;
 }
 
@@ -54,16 +84,67 @@ pid_t start_program(const char *cmdStr, std::size_t len)
 {
     char line[512];
     std::snprintf(line, sizeof line, "exec %.*s", static_cast<int>(len), cmdStr);
-    return start_shell(line, -1, -1);
+    return start_shell(line, false);
 }
 
-/* Waits for the shell; its status as system() has it. */
+/* Whether the shell line must not be run, as nobody waits for it any more (logged). */
+bool is_skipped(const char *cmdStr)
+{
+    if (!log_served_given_up())
+        return false;
+    LOG_NOTE("[%s] is skipped, nobody waits for it any more\n", cmdStr);
+    return true;
+}
+
+/* Whether the child ends in that time. Then it is forgotten, and its status stored. */
+bool ends_within(pid_t child, std::chrono::seconds time, int *status = nullptr)
+{
+    const auto end = log_clock::now() + time;
+    while (waitpid(child, status, WNOHANG) == 0) {
+        if (log_clock::now() >= end)
+            return false;
+        usleep(kLookAgain);
+    }
+    return true;
+}
+
+/* Ends a shell with all that it runs, as nobody waits for them any more; its status. */
+int end_group(pid_t shell)
+{
+    LOG_NOTE("process group %d is asked to end, nobody waits for it any more\n", static_cast<int>(shell));
+    kill(-shell, SIGTERM);
+    int status = -1;
+    bool ended = false; /* the shell: what it has started may take longer */
+    for (const auto end = log_clock::now() + kTerminatesMax; log_clock::now() < end; usleep(kLookAgain)) {
+        ended = ended || waitpid(shell, &status, WNOHANG) != 0;
+        if (ended && kill(-shell, 0) != 0)
+            return status;
+    }
+    LOG_NOTE("process group %d does not end and is killed\n", static_cast<int>(shell));
+    kill(-shell, SIGKILL);
+    if (!ended)
+        ends_within(shell, kDiesMax, &status);
+    return status;
+}
+
+/* Waits for the shell, for as long as somebody waits for it; its status as system() has it. */
 int await_shell(pid_t shell)
 {
+    if (shell == -1)
+        return -1;
+    const unique_fd end{static_cast<int>(syscall(SYS_pidfd_open, shell, 0))}; /* old kernels have none */
     int status = -1;
-    while (shell != -1 && waitpid(shell, &status, 0) == -1)
-        if (errno != EINTR)
+    for (pid_t ended = 0; ended != shell;) {
+        ended = waitpid(shell, &status, WNOHANG);
+        if (ended == -1 && errno != EINTR)
             return -1;
+        if (ended == 0 && log_served_given_up())
+            return end_group(shell);
+        if (ended == 0 && end)
+            log_wait_ready(end.get(), POLLIN, -1, kStillWanted);
+        else if (ended == 0)
+            usleep(kLookAgain);
+    }
     return status;
 }
 
@@ -85,11 +166,17 @@ int judge_cmd(const char *cmdStr, int status)
     return result;
 }
 
-/* Reads up to `size` bytes, to the end of the first line at least; their number. */
+/* Reads up to `size` bytes, to the end of the first line at least, for as long as somebody waits for them; their
+ * number. */
 int read_line(int fd, char *buffer, int size)
 {
     int held = 0;
     while (held < size && std::memchr(buffer, '\n', static_cast<std::size_t>(held)) == nullptr) {
+        if (log_wait_ready(fd, POLLIN, -1, kStillWanted) == 0) {
+            if (log_served_given_up())
+                break;
+            continue;
+        }
         const ssize_t n = read(fd, buffer + held, static_cast<std::size_t>(size - held));
         if (n > 0)
             held += static_cast<int>(n);
@@ -99,29 +186,17 @@ int read_line(int fd, char *buffer, int size)
     return held;
 }
 
-/* Whether the child ends in that time. Then it is forgotten, and its status stored. */
-bool ends_within(pid_t child, std::chrono::seconds time, int *status = nullptr)
-{
-    const auto end = log_clock::now() + time;
-    while (waitpid(child, status, WNOHANG) == 0) {
-        if (log_clock::now() >= end)
-            return false;
-        usleep(kLookAgain);
-    }
-    return true;
-}
-
 } // namespace
 
 int log_exec_cmd(const char *cmdStr)
 {
-    return cmdStr != nullptr ? log_exec_cmd_with(cmdStr, -1) : -1;
+    return cmdStr != nullptr && !is_skipped(cmdStr) ? log_exec_cmd_with(cmdStr, -1) : -1;
 }
 
 int log_exec_cmd_with(const char *cmdStr, int handed_fd)
 {
     LOG_NOTE("cmdStr[%s]\n", cmdStr);
-    return judge_cmd(cmdStr, await_shell(start_shell(cmdStr, handed_fd, -1)));
+    return judge_cmd(cmdStr, await_shell(start_shell(cmdStr, !is_behind(cmdStr), handed_fd)));
 }
 
 pid_t log_exec_cmd_behind(const char *cmdStr)
@@ -171,11 +246,11 @@ int vex_popen(const char *cmd, char *buffer, int size)
     }
     std::memset(buffer, 0, static_cast<std::size_t>(std::max(size, 0)));
     int ends[2];
-    if (pipe2(ends, O_CLOEXEC) != 0)
+    if (is_skipped(cmd) || pipe2(ends, O_CLOEXEC) != 0)
         return 0;
     unique_fd output{ends[0]};
     unique_fd input{ends[1]};
-    const pid_t shell = start_shell(cmd, -1, input.get());
+    const pid_t shell = start_shell(cmd, true, -1, input.get());
     input.reset(); /* the shell has its own: the line ends with the programs that write it */
     const int len = read_line(output.get(), buffer, size - 1);
     output.reset();

@@ -22,7 +22,8 @@ namespace
 
 constexpr char kLogSource[] = "vex_log_manage";
 
-constexpr unsigned kExitPoll = 5; /* seconds between two looks at exit_flag */
+constexpr auto kExitPoll =
+    std::chrono::seconds(5); /* between two looks at exit_flag, which is also told when it is set */
 
 /* Takes one unit of the start counter; false when there is none left and the daemon is to stay off. */
 bool consume_start()
@@ -67,12 +68,14 @@ int run_client_mode()
     return 0;
 }
 
-void wait_for_exit()
+/* Waits until the process is to end, for a while; whether it is. */
+bool is_ending()
 {
-    while (g_daemon.exit_flag == 0) {
-        sleep(kExitPoll);
-        log_reap_programs();
-    }
+    const auto end = log_clock::now() + kExitPoll;
+    const log_lock hold{g_daemon.exit_lock};
+    while (g_daemon.exit_flag == 0 && log_clock::now() < end)
+        g_daemon.exit_lock.wait_until(g_daemon.exit_change, end);
+    return g_daemon.exit_flag != 0;
 }
 
 } // namespace
@@ -91,7 +94,8 @@ int main(int argc, char **argv)
         run_server_mode();
     else if (const int status = run_client_mode(); status != 0)
         return status;
-    wait_for_exit();
+    while (!is_ending())
+        log_reap_programs();
     log_streams_end_all();
     std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
     _exit(0);            /* other threads still run: nothing that they use may be torn down */

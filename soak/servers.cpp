@@ -42,11 +42,11 @@ void random_server::serve(tool_clock::time_point end)
     }
 }
 
-daemon_says random_server::calm()
+daemon_says random_server::calm(int milliseconds)
 {
     links_.clear();
     const bool said = control_->say(end_of("syslog")) && control_->say(end_of("qxdm"));
-    return said ? control_->answer(kPatience) : daemon_says::goodbye;
+    return said ? control_->answer(milliseconds) : daemon_says::goodbye;
 }
 
 /* Takes a call that is there, or treats it badly. */

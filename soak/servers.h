@@ -17,7 +17,7 @@ public:
     /* Serves it until `end`, or until either has had enough of the other. */
     void serve(tool_clock::time_point end);
     /* Hangs up on all streams and ends them, and asks once more. */
-    daemon_says calm();
+    daemon_says calm(int milliseconds);
 
 private:
     void take_call();

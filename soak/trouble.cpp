@@ -17,12 +17,6 @@ const std::string kOverrides = "/usr/vex/override/";
 /* By their own path: no program of the device is to be relied on meanwhile. */
 const std::string kKill = "/usr/bin/busybox killall -9 ";
 
-/* Ends programs that hang. */
-void wake()
-{
-    run_command(kKill + "sleep");
-}
-
 } // namespace
 
 device_trouble::device_trouble(soak_tally &tally) : tally_(tally) {}
@@ -30,15 +24,12 @@ device_trouble::device_trouble(soak_tally &tally) : tally_(tally) {}
 void device_trouble::run(dice chance, tool_clock::time_point end)
 {
     while (tool_clock::now() < end && !testing::Test::HasFailure()) {
-        switch (chance.below(6)) {
+        switch (chance.below(5)) {
         case 0:
             program(chance);
             break;
         case 1:
             disk(chance);
-            break;
-        case 2:
-            wake();
             break;
         default:
             call(chance);
@@ -62,6 +53,7 @@ void device_trouble::program(dice &chance)
                        "exec /usr/bin/yes 'more than one line, and none of them is what was asked for' 2>/dev/null | "
                        "/usr/bin/head -500",
                        "exec /usr/bin/sleep 1000"});
+    hangs_ = hangs_ || instead.ends_with("sleep 1000");
     install_program(name, instead);
 }
 
@@ -99,7 +91,11 @@ void device_trouble::mend()
     for (const auto &entry : std::filesystem::directory_iterator(kOverrides))
         std::filesystem::remove(entry.path());
     std::filesystem::remove(kFill);
-    wake();
-    for (const char *name : {"yes", "syslogd", "diag_mdlog", "tcpdump"})
+}
+
+void device_trouble::clear_away()
+{
+    hangs_ = false;
+    for (const char *name : {"sleep", "yes", "syslogd", "diag_mdlog", "tcpdump"})
         run_command(kKill + name);
 }

@@ -14,6 +14,7 @@
 namespace
 {
 
+const std::string kAsked = "log_recv_tcp_msg:===========recv data len =47"; /* for the modem's mode, has arrived */
 const std::string kAskVersion = R"({"msgid":"3","VersionInfo":""})";
 
 TEST_F(Daemon, StartConsumesOneUnitOfItsCounter)
@@ -179,7 +180,7 @@ TEST_F(Daemon, KeepsReplacedToolsCommandsFromTheNewOne)
     {
         for (int i = 0; i < 20; ++i) { /* wait for their turn until they are replaced, and leave nothing behind */
             tool_connection("::1").send(frame(kAskMode));
-            ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =47", i + 1));
+            ASSERT_TRUE(daemon_->logs(kAsked, i + 1));
         }
         const tool_connection second("::1"); /* nor is its confirmation of a data link run beside the other's command */
         second.send(frame(R"({"msgid":"10","DataLink":{"imei":"356938035643809","ConnectType":"modemlog_connect"}})") +
@@ -196,6 +197,38 @@ TEST_F(Daemon, KeepsReplacedToolsCommandsFromTheNewOne)
     EXPECT_EQ(21, daemon_->logged("another tool has taken over, command dropped"));
     EXPECT_EQ(0, daemon_->logged("modem mode = lpm"));
     EXPECT_EQ(2, daemon_->logged("send pkg success"));
+}
+
+/* A program hangs and does not even end when it is asked to, with others behind it. Whoever comes next is answered all
+ * the same; what a tool has left running lives on. */
+TEST_F(Daemon, IsNotHeldUpByAProgramThatHangs)
+{
+    install_program("df", "trap '' TERM; echo started >/tmp/started; while :; do sleep 1; done");
+    ASSERT_EQ(0, mkfifo("/tmp/started", 0600));
+    start();
+    const tool_connection first;
+    EXPECT_NE("(closed)", first.ask(R"({"msgid":"5","tcpdump":{"InterfaceName":"lo","Action":"start"}})"));
+    first.send(frame(R"({"msgid":"2"})"));
+    EXPECT_EQ("started\n", read_file("/tmp/started"));
+    const auto replaced = std::chrono::steady_clock::now();
+    const tool_connection second("::1");
+    EXPECT_EQ("(closed)", first.receive());
+    EXPECT_EQ(kOnline, second.ask(kAskMode));
+    EXPECT_GT(std::chrono::seconds(15), std::chrono::steady_clock::now() - replaced);
+    for (const char *line : {"nobody waits any more for what fd[", "the command before is still at work, fd[",
+                             " is asked to end, nobody waits for it any more", " does not end and is killed",
+                             "] is skipped, nobody waits for it any more"})
+        EXPECT_NE(0, daemon_->logged(line)) << line;
+    EXPECT_NE("", run_command("busybox pidof tcpdump"));
+    second.send(frame(R"({"msgid":"2"})"));
+    EXPECT_EQ("started\n", read_file("/tmp/started"));
+    const long asked = daemon_->logged(kAsked);
+    for (int i = 1; i <= 200; ++i) {
+        tool_connection("::1").send(frame(kAskMode));
+        ASSERT_TRUE(daemon_->logs(kAsked, asked + i));
+    }
+    EXPECT_EQ(kOnline, tool_connection("::1").ask(kAskMode));
+    EXPECT_TRUE(settles());
 }
 
 /* A tool orders replies without reading one, until the daemon blocks in its send; the next tool is served. */

@@ -577,7 +577,12 @@ TEST_F(Streams, AreNotHeldUpByAProgramThatHangs)
     confirm(link, kModem);
     EXPECT_TRUE(take(link, 100000).first);
     auto link_end = std::async(std::launch::async, [&link] { return ends_clean(link); });
+    std::string why; /* the control link's own command hangs, and so does that for the stream's end */
+    EXPECT_TRUE(tool_send(*control_, R"({"msgid":"3"})", {}, why));
+    EXPECT_EQ("runs\n", read_file("/tmp/runs"));
+    const auto hung_up = std::chrono::steady_clock::now();
     hang_up();
+    EXPECT_GT(std::chrono::seconds(20), std::chrono::steady_clock::now() - hung_up);
     EXPECT_TRUE(link_end.get());
 }
 
@@ -592,6 +597,7 @@ TEST_F(Streams, LeaveTheLatestLocalLogBehind)
     for (int i = 0; i < 8; ++i) {
         const std::string level = std::to_string(1 + i % 7);
         tool_link link = start(kSyslog);
+        EXPECT_TRUE(daemon_->logs("enter log_recv_server_msg", i + 1));
         confirm(link, kSyslog);
         end(kSyslog);
         EXPECT_EQ(R"({"msgid":"4","syslogParaSet":{"sysloglevel":")" + level +
