@@ -8,9 +8,11 @@
  *   a log's `run_lock`   one start of a log program at a time, and the wait of a few seconds for what is in its way
  *                        (core/log_programs.h)
  *   ssl_ctx_lock         the TLS context (core/daemon_state.h)
+ *   g_intake_lock        one intake at a time is put at its path (client/log_stream.cpp)
  *   g_registry_lock      the fields of the registry, and the live streams (client/log_stream.cpp). Held for a few
  *                        instructions: no waiting for a peer, sending, logging or starting of threads and programs
  *   a session's `lock_`  one library call on it (core/log_tls_session.h)
+ *   exit_lock            whether the process is to end (core/daemon_state.h)
  *   bsp_record_lock      one change of the record of kernel-module levels at a time (handlers/bsp_module_level.cpp)
  */
 #ifndef CORE_LOG_REGISTRY_H

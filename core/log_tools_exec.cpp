@@ -127,8 +127,9 @@ int end_group(pid_t shell)
     return status;
 }
 
-/* Waits for the shell, for as long as somebody waits for it; its status as system() has it. */
-int await_shell(pid_t shell)
+/* Waits for the shell; for one with a process group of its own, as long as somebody waits for it. Its status as system()
+ * has it. */
+int await_shell(pid_t shell, bool alone)
 {
     if (shell == -1)
         return -1;
@@ -138,7 +139,7 @@ int await_shell(pid_t shell)
         ended = waitpid(shell, &status, WNOHANG);
         if (ended == -1 && errno != EINTR)
             return -1;
-        if (ended == 0 && log_served_given_up())
+        if (ended == 0 && alone && log_served_given_up())
             return end_group(shell);
         if (ended == 0 && end)
             log_wait_ready(end.get(), POLLIN, -1, kStillWanted);
@@ -196,7 +197,8 @@ int log_exec_cmd(const char *cmdStr)
 int log_exec_cmd_with(const char *cmdStr, int handed_fd)
 {
     LOG_NOTE("cmdStr[%s]\n", cmdStr);
-    return judge_cmd(cmdStr, await_shell(start_shell(cmdStr, !is_behind(cmdStr), handed_fd)));
+    const bool alone = !is_behind(cmdStr);
+    return judge_cmd(cmdStr, await_shell(start_shell(cmdStr, alone, handed_fd), alone));
 }
 
 pid_t log_exec_cmd_behind(const char *cmdStr)
@@ -254,7 +256,7 @@ int vex_popen(const char *cmd, char *buffer, int size)
     input.reset(); /* the shell has its own: the line ends with the programs that write it */
     const int len = read_line(output.get(), buffer, size - 1);
     output.reset();
-    await_shell(shell);
+    await_shell(shell, true);
     buffer[std::strcspn(buffer, "\n")] = '\0';
     return len > 0 ? 1 : 0;
 }
