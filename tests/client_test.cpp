@@ -201,7 +201,7 @@ TEST_F(Client, GoesOnWithoutItsThreadOrItsAnnouncement)
         let_fail({.call = kFaultThread});
         const daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
         EXPECT_TRUE(daemon.logs("vex_log_client_ctl_thread  FAIL"));
-        while (!daemon.waits_in(SYS_clock_nanosleep)) /* and does not end */
+        while (!daemon.waits_in(SYS_futex)) /* and does not end */
             std::this_thread::yield();
     }
     std::ofstream("/tmp/ask") << frame(kAskMode);
