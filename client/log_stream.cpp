@@ -315,15 +315,16 @@ void end_link(const shared_stream &stream, log_link &link)
         log_locally(stream->kind, *change);
 }
 
-void take_piece(log_link &link, log_reassembly &state, std::span<const unsigned char> piece)
+bool take_piece(log_link &link, log_reassembly &state, std::span<const unsigned char> piece)
 {
     constexpr char kName[] = "log_recv_server_msg";
     if (link.taken) {
         LOG_NOTE("%s: the stream was stopped or started anew, what fd[%d] brought is dropped\n", kName, link.fd.get());
-        return;
+        return true;
     }
     LOG_NOTE("%s:recvbuf=%.*s\n", kName, static_cast<int>(piece.size()), reinterpret_cast<const char *>(piece.data()));
     log_proc_tcp_pkg(state, piece);
+    return true;
 }
 
 /* Reads the link until it ends, and closes it. */

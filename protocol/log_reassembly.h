@@ -11,6 +11,7 @@
 
 #include "core/log_record.h"
 #include "protocol/log_pkg_codec.h"
+#include "protocol/log_request_line.h"
 
 #include <cstddef>
 #include <span>
@@ -27,6 +28,7 @@ struct log_incoming {
 struct log_reassembly {
     log_record_ptr<log_incoming> incoming; /* allocated by the first piece */
     std::size_t recv_pkg_len = 0;          /* bytes held, from offset 0 */
+    log_request_line opening;              /* for the receive loop, which keeps browsers away */
 };
 
 /*

@@ -1,5 +1,6 @@
 #include "protocol/log_recv.h"
 
+#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
 
@@ -11,17 +12,22 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 constexpr char kName[] = "log_recv_tcp_msg"; /* the routine that the log lines speak of */
 
-void take_piece(log_link & /*link*/, log_reassembly &state, std::span<const unsigned char> piece)
+bool take_piece(log_link &link, log_reassembly &state, std::span<const unsigned char> piece)
 {
+    if (g_daemon.run_mode == 0 && log_take_request_line(state.opening, piece)) {
+        LOG_NOTE("%s: fd=[%d] sends an HTTP request, closed\n", kName, link.fd.get());
+        return false;
+    }
     LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(piece.size()));
     log_proc_tcp_pkg(state, piece);
     LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
+    return true;
 }
 
-/* Logs why the peer's bytes have ended: an error, or 0. One that was replaced did not end them. */
+/* Logs why the peer's bytes have ended: an error, or 0. One that was replaced or refused did not end them. */
 void log_end(const log_link &link, int error)
 {
-    if (link.taken)
+    if (link.taken || error == -1)
         return;
     if (error != 0)
         LOG_NOTE("%s:recvfrom error,errno msg=%s\n", kName, std::strerror(error));
@@ -35,10 +41,12 @@ int log_recv_link(log_link &link, log_take_piece take)
 {
     log_reassembly state;
     unsigned char piece[kLogPieceMax];
-    return log_read_pieces([&] { return link.read(piece, sizeof piece); },
-                           [&](std::size_t len) {
-                               take(link, state, {piece, len});
-                           });
+    bool wanted = true;
+    const int error = log_read_pieces([&] { return wanted ? link.read(piece, sizeof piece) : 0; },
+                                      [&](std::size_t len) {
+                                          wanted = take(link, state, {piece, len});
+                                      });
+    return wanted ? error : -1;
 }
 
 void log_recv_tcp_msg(log_link &link, void (*close)(log_link &link))

@@ -166,6 +166,26 @@ TEST_F(Daemon, KeepsNothingOfThreeHundredTools)
     EXPECT_TRUE(settles());
 }
 
+/* A page in somebody's browser brings a frame to the port, behind what makes the daemon forget what it holds. */
+TEST_F(Daemon, TakesNothingFromAWebBrowser)
+{
+    start();
+    const std::string body = "\r\n\r\n" + std::string(61440, 'x') + frame(R"({"msgid":"11","mode_lpm_online":"lpm"})");
+    long closed = 0;
+    for (const char *line : {"POST / HTTP/1.1", "PRI * HTTP/2.0"}) {
+        const tool_connection page(closed == 0 ? "127.0.0.1" : "::1");
+        page.send(std::string(line, 3));
+        ASSERT_TRUE(daemon_->logs("log_recv_tcp_msg:===========recv data len =3=", ++closed));
+        const std::string rest = line + 3 + body;
+        send(page.fd.get(), rest.data(), rest.size(), MSG_NOSIGNAL); /* is reset on the way */
+        EXPECT_TRUE(daemon_->logs("sends an HTTP request, closed", closed)) << line;
+        EXPECT_EQ("(closed)", page.receive());
+    }
+    EXPECT_EQ(kOnline, tool_connection().ask(kAskMode));
+    EXPECT_EQ(0, daemon_->logged(R"("mode_lpm_online":"lpm")"));
+    EXPECT_TRUE(settles());
+}
+
 /* A tool asks for something slow and is replaced meanwhile. The new tool is accepted at once, its command
  * waits for the other to end, and not a word meant for the first tool reaches it. */
 TEST_F(Daemon, KeepsReplacedToolsCommandsFromTheNewOne)

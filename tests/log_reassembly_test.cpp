@@ -61,4 +61,24 @@ TEST_F(Reassembly, StartsAfreshWithThePieceThatWouldFillTheBuffer)
     EXPECT_NE("", feed(frame(R"({"msgid":"1"})", std::string(61439 - kThree.size(), 'd'))));
 }
 
+TEST(RequestLine, IsKnownHoweverItArrives)
+{
+    const auto is_request = [](const std::string &opening, std::size_t cut) {
+        log_request_line line;
+        return log_take_request_line(line, {bytes(opening), cut}) ||
+               log_take_request_line(line, {bytes(opening) + cut, opening.size() - cut});
+    };
+    for (const std::string &opening :
+         {std::string("POST / HTTP/1.1\r\n"), std::string("GET http://device:48888/?a=b HTTP/1.0"),
+          std::string("PRI * HTTP/2.0"), std::string("M-SEARCH * HTTP/"), std::string("patch /\xc3\xa4 HTTP/1.1"),
+          "GET /" + std::string(70000, 'a') + " HTTP/1.1"})
+        for (std::size_t cut = 0; cut < 12; ++cut)
+            EXPECT_TRUE(is_request(opening, cut)) << opening.substr(0, 20) << cut;
+    for (const std::string &opening :
+         {kThree, std::string("#~ / HTTP/1.1"), std::string(" / HTTP/1.1"), std::string("GET  HTTP/1.1"),
+          std::string("GET / HTCPCP/1.0"), std::string("GET /\n HTTP/1.1"), std::string("G\0T / HTTP/1.1", 14)})
+        for (std::size_t cut = 0; cut < 8; ++cut)
+            EXPECT_FALSE(is_request(opening, cut)) << opening << cut;
+}
+
 } // namespace
