@@ -46,6 +46,16 @@ void settle(program_state &state) LOG_REQUIRES(state.run_lock)
         log_end_child(child);
 }
 
+/* Reads a level or a size. One that was kept when peers could still set any is not run: it counts as missing. */
+void read_plain(const char *name, char (&value)[32], int size)
+{
+    vex_get_nv_item(name, value, size);
+    if (log_is_plain_word(value))
+        return;
+    LOG_NOTE("%s = [%s] has a character that the shell would interpret, not used\n", name, value);
+    value[0] = '\0';
+}
+
 bool has_config()
 {
     if (access("/logfs/logconf//Diag.cfg", F_OK) == 0)
@@ -146,8 +156,8 @@ log_syslog_items log_read_syslog_items(int field_size)
 {
     log_syslog_items items;
     vex_get_nv_item("syslog_path", items.path, field_size);
-    vex_get_nv_item("syslog_level", items.level, field_size);
-    vex_get_nv_item("syslog_size", items.size, field_size);
+    read_plain("syslog_level", items.level, field_size);
+    read_plain("syslog_size", items.size, field_size);
     return items;
 }
 

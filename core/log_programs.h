@@ -63,7 +63,8 @@ struct log_syslog_items {
     char size[32] = {};
 };
 
-/* Reads them, cut to `field_size` - 1 characters; `field_size` is up to 32. */
+/* Reads them, cut to `field_size` - 1 characters; `field_size` is up to 32. A level or size that is no
+ * log_is_plain_word() is empty (logged). */
 log_syslog_items log_read_syslog_items(int field_size);
 
 /* Starts the device's own system log, and waits until its script has ended. Before there are any threads. */

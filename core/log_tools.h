@@ -107,6 +107,10 @@ int log_isValidIpOrUrl(const char *text);
  * no IPv4 address. */
 int ip_in_subnet(const char *address, const char *peer, const char *netmask);
 
+/* Whether a text can be a word, or several, of a shell command line and nothing more: it has no control character and
+ * none of ; & | < > ( ) $ ` " ' \ # * ? [ ~. */
+bool log_is_plain_word(const char *text);
+
 /* Copies the field number `n`, from 0, of a text of fields between delimiters to `out`, cut to size - 1
  * characters. 0 copied, -1 when there is no such field or on bad arguments; `out` is then as it was. */
 int getNthValueSafe(int n, const char *text, char delimiter, char *out, int size);

@@ -42,6 +42,15 @@ int ip_in_subnet(const char *address, const char *peer, const char *netmask)
     return result;
 }
 
+bool log_is_plain_word(const char *text)
+{
+    for (; *text != '\0'; ++text)
+        if (static_cast<unsigned char>(*text) < ' ' || *text == 0x7f ||
+            std::strchr(";&|<>()$`\"'\\#*?[~", *text) != nullptr)
+            return false;
+    return true;
+}
+
 int getNthValueSafe(int n, const char *text, char delimiter, char *out, int size)
 {
     if (text == nullptr || delimiter == '\0' || out == nullptr || size <= 0) {

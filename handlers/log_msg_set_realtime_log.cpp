@@ -6,10 +6,30 @@
 namespace
 {
 
-/* Reads the server's address, which a request has in client mode only. */
-bool read_server(const cJSON *realtime, live_log_request *request)
+/* Whether an address is kept, and goes into the reply, as it is. */
+bool can_be_replied(const char *ip)
+{
+    std::size_t len = 0;
+    for (; ip[len] != '\0'; ++len)
+        if (static_cast<unsigned char>(ip[len]) < ' ' || ip[len] == 0x7f || std::strchr("\"'\\", ip[len]) != nullptr)
+            return false;
+    return len < sizeof live_log_request::ip;
+}
+
+/* The address to which a start wants the log; one that cannot be replied is none. Any other request may have any text. */
+const char *read_ip(const cJSON *realtime, bool starts)
 {
     const char *const ip = log_member_told(realtime, "ip", "K_ip", "server IP = [%s]\n");
+    if (ip == nullptr || !starts || can_be_replied(ip))
+        return ip;
+    LOG_NOTE("this IP cannot be used\n");
+    return nullptr;
+}
+
+/* Reads the server's address, which a request has in client mode only. */
+bool read_server(const cJSON *realtime, bool starts, live_log_request *request)
+{
+    const char *const ip = read_ip(realtime, starts);
     const char *const port = log_member_told(realtime, "port", "K_port", "server Port = [%s]\n");
     if (ip == nullptr || port == nullptr)
         return false;
@@ -26,7 +46,8 @@ bool read_request(const cJSON *tree, live_log_request *request)
         return false;
     const char *const log_type = log_member_told(realtime, "LogType", "K_LogType", "LogType = %s\n");
     const char *const action = log_member_told(realtime, "Action", "K_Action", "Action = %s\n");
-    const bool has_server = g_daemon.run_mode != 1 || read_server(realtime, request);
+    const bool has_server = g_daemon.run_mode != 1 ||
+                            read_server(realtime, action != nullptr && std::strcmp(action, "start") == 0, request);
     if (log_type == nullptr || action == nullptr || !has_server)
         return false;
     log_keep_text(request->log_type, log_type);

@@ -23,11 +23,16 @@ void reply(const char *level, const char *size, const char *result)
               level, size, result);
 }
 
-/* Takes a value into its field; false when it is too long, which would make another value of it. */
+/* Takes a value into its field; false when it is too long, which would make another value of it, or when the shell would
+ * make something of it. */
 bool take(char (&field)[kFieldSize], const char *value, const char *name)
 {
     if (std::strlen(value) >= kFieldSize) {
         LOG_NOTE("%s is longer than %d characters, refused\n", name, static_cast<int>(kFieldSize - 1));
+        return false;
+    }
+    if (!log_is_plain_word(value)) {
+        LOG_NOTE("%s has a character that the shell would interpret, refused\n", name);
         return false;
     }
     log_keep_text(field, value);

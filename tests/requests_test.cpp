@@ -104,6 +104,23 @@ TEST_F(Requests, AreToldWhenAMemberIsMissing)
     EXPECT_EQ("", ask(6, R"("realtimeLog":{"LogType":"syslog","Action":"stop","ip":"1.1.1.1","port":"1"})"));
 }
 
+TEST_F(Requests, ToStreamToAnAddressThatCannotBeOneAreToldSo)
+{
+    g_daemon.run_mode = 1;
+    for (const std::string &ip : {std::string(R"(1\"1)"), std::string("1'1"), std::string(R"(1\\1)"),
+                                  std::string(R"(1\n1)"), std::string(R"(1\u007f)"), std::string(64, '1')}) {
+        const auto request = [&](const char *action) {
+            return R"("realtimeLog":{"LogType":"qxdm","Action":")" + std::string(action) + R"(","ip":")" + ip +
+                   R"(","port":"1"})";
+        };
+        EXPECT_EQ(R"({"msgid":"6","realtimeLog":{"LogType":"","Action":"","protocol":"","port":"0","ip":""},)"
+                  R"("Result":"Fail:Device internal error"})",
+                  ask(6, request("start")));
+        EXPECT_FALSE(g_platform.logged("cmdStr["));
+        EXPECT_NE(std::string::npos, ask(6, request("end")).find("Success"));
+    }
+}
+
 TEST_F(Requests, ToConfirmALinkAreTheDevicesOwnServersOnly)
 {
     g_platform.items["imei"] = "356938035643809";
