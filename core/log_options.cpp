@@ -13,21 +13,25 @@ namespace
 
 constexpr char kLogSource[] = "vex_log_manage";
 
-constexpr std::size_t kArgumentMax = 63; /* characters: readers of these items have 64 bytes for them */
+/* Characters: readers of these items have 64 bytes and 16 for them. */
+constexpr std::size_t kAddressMax = 63;
+constexpr std::size_t kPortMax = 15;
 
-/* An argument that could not be read back whole changes nothing. */
-void refuse(const char *option, const char *argument)
+/* Whether an argument can be read back whole; one that cannot changes nothing, which is told. */
+bool fits(const char *option, const char *argument, std::size_t max)
 {
-    LOG_NOTE("%s: argument of %zu characters refused, %zu is the most\n", option, std::strlen(argument), kArgumentMax);
-    std::fprintf(stderr, "%s: the argument is longer than %zu characters, ignored\n", option, kArgumentMax);
+    const std::size_t len = std::strlen(argument);
+    if (len <= max)
+        return true;
+    LOG_NOTE("%s: argument of %zu characters refused, %zu is the most\n", option, len, max);
+    std::fprintf(stderr, "%s: the argument is longer than %zu characters, ignored\n", option, max);
+    return false;
 }
 
 void set_address(const char *address)
 {
-    if (std::strlen(address) > kArgumentMax) {
-        refuse("--address", address);
+    if (!fits("--address", address, kAddressMax))
         return;
-    }
     vex_set_nv_item("log_manage_mode", "1", 1);
     vex_set_nv_item("log_server_addr", address, static_cast<int>(std::strlen(address)));
     LOG_NOTE("set vex_log_manage client mode\n");
@@ -35,10 +39,8 @@ void set_address(const char *address)
 
 void set_port(const char *port)
 {
-    if (std::strlen(port) > kArgumentMax) {
-        refuse("--port", port);
+    if (!fits("--port", port, kPortMax))
         return;
-    }
     vex_set_nv_item("log_server_port", port, static_cast<int>(std::strlen(port)));
 }
 

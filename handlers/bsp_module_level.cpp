@@ -51,16 +51,19 @@ public:
     {
         const int n = std::snprintf(text_ + len_, sizeof text_ - len_, "%s,%s;", name, level);
         full_ = full_ || static_cast<std::size_t>(n) >= sizeof text_ - len_;
+        ++entries_;
         if (!full_)
             len_ += static_cast<std::size_t>(n);
     }
     const char *text() const { return text_; }
     int length() const { return static_cast<int>(len_); }
     bool full() const { return full_; }
+    int entries() const { return entries_; } /* that were appended */
 
 private:
     char text_[kBspRecordSize] = {};
     std::size_t len_ = 0;
+    int entries_ = 0;
     bool full_ = false;
 };
 
@@ -68,8 +71,10 @@ private:
 bool rewrite_entry(const bsp_entry &entry, const char *name, const char *level, record_text *out)
 {
     LOG_NOTE("bsp_moduleLogInfo =[%s][%d]\n", entry.text, static_cast<int>(std::strlen(entry.text)));
-    if (!entry.has_level)
+    if (!entry.has_level) {
+        LOG_NOTE("%s: [%s] has no level, dropped\n", kItem, entry.text);
         return false;
+    }
     LOG_NOTE("bsp bsp_moduleName =[%s]\n", entry.name);
     LOG_NOTE("bsp bsp_moduleLevel =[%s]\n", entry.level);
     const bool found = std::strcmp(entry.name, name) == 0;
@@ -121,6 +126,8 @@ int log_set_bsp_module_level(const char *name, const char *level)
             found = rewrite_entry(entry, name, level, &out) || found;
     if (!found)
         out.append(name, level);
+    if (!found && out.entries() > kPiecesMax)
+        LOG_NOTE("%s has no room for %s: only its first %d entries are looked at\n", kItem, name, kPiecesMax);
     if (out.full()) {
         LOG_NOTE("%s has no room for %s\n", kItem, name);
         return -1;
@@ -142,8 +149,12 @@ void log_restore_bsp_module_level()
     char record[kBspRecordSize] = {};
     read_record(record);
     bsp_entry entry;
-    for (int i = 0; i < kPiecesMax; ++i)
-        if (read_entry(record, i, sizeof entry.text, sizeof entry.name, &entry) && log_bsp_text_allowed(entry.name) &&
-            log_bsp_text_allowed(entry.level) && std::strcmp(entry.level, kBspDefaultLevel) != 0)
+    for (int i = 0; i < kPiecesMax; ++i) {
+        if (!read_entry(record, i, sizeof entry.text, sizeof entry.name, &entry) || entry.text[0] == '\0')
+            continue;
+        if (!log_bsp_text_allowed(entry.name) || !log_bsp_text_allowed(entry.level))
+            LOG_NOTE("%s: [%s] is skipped\n", kItem, entry.text);
+        else if (std::strcmp(entry.level, kBspDefaultLevel) != 0)
             log_apply_bsp_module_level(entry.name, entry.level);
+    }
 }

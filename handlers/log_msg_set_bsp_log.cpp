@@ -6,6 +6,8 @@
 namespace
 {
 
+constexpr std::size_t kQueriedNameMax = 900; /* characters; with the rest, the reply stays below 1023 */
+
 struct bsp_request {
     const char *name;
     const char *level; /* empty: which one is set? */
@@ -28,12 +30,29 @@ bool read_request(const cJSON *tree, bsp_request *request)
     return request->name != nullptr && request->level != nullptr;
 }
 
+/* Whether a name can be part of a reply: as it is, and with room for the rest. */
+bool can_be_replied(const char *name)
+{
+    std::size_t len = 0;
+    for (; name[len] != '\0'; ++len)
+        if (static_cast<unsigned char>(name[len]) < ' ' || std::strchr("\"\\", name[len]) != nullptr)
+            return false;
+    return len <= kQueriedNameMax;
+}
+
+bool is_allowed(const bsp_request &request)
+{
+    if (*request.level == '\0')
+        return can_be_replied(request.name);
+    return log_bsp_text_allowed(request.name) && log_bsp_text_allowed(request.level);
+}
+
 void serve(const bsp_request &request)
 {
     const bool query = *request.level == '\0';
     if (*request.name == '\0') {
         reply("", "", "Fail:unkonw bsp module name");
-    } else if (!log_bsp_text_allowed(request.name) || (!query && !log_bsp_text_allowed(request.level))) {
+    } else if (!is_allowed(request)) {
         reply("", "", kParameterError);
     } else if (query) {
         char level[kBspFieldSize];

@@ -40,11 +40,13 @@ void flatten()
     log_exec_cmd(cmd);
 }
 
-/* Unpacks the package and starts its set-up script. What fails here is in the log only. */
-void complete(FILE *package)
+/* Unpacks the package of `total` bytes and starts its set-up script. What fails here is in the log only. */
+void complete(FILE *package, int total)
 {
     LOG_NOTE("logconf file recv all,write complete\n");
     log_sync_file(package);
+    if (const std::int32_t size = log_get_file_size(kPackage); size > total)
+        LOG_NOTE("logconf file has %d bytes, %d were announced: an earlier one is in front of it\n", size, total);
     log_exec_cmd("rm -rf /logfs/logconf/");
     log_exec_cmd("mkdir /logfs/logconf/");
     log_exec_cmd("cd /logfs/logconf/ && tar -xf /logfs/logconf.tar");
@@ -67,7 +69,7 @@ bool append(const unsigned char *data, std::int32_t dataLen, int total)
     if (written < dataLen)
         LOG_NOTE("write fail,wrCount=%d,dataLen=%d\n", written, dataLen);
     if ((g_daemon.conf_recv_len += written) == total && total != 0)
-        complete(package);
+        complete(package, total);
     log_sync_file(package);
     log_close_file(package);
     return written == dataLen;

@@ -90,6 +90,14 @@ TEST_F(Handlers, SetAndTellTheSystemLogsParameters)
            {request("5", "0123456789abcdef"), reply(R"("sysloglevel":"","syslogsize":"")", kInternal), ""},
            {request("5", "0123456789abcde"), reply(R"("sysloglevel":"5","syslogsize":"0123456789abcde")"),
             script + "5 -s 0123456789abcde &\n"}});
+    const std::string refused = reply(R"("sysloglevel":"","syslogsize":"")", kInternal);
+    for (const char *mark : {";", "&",    "|", "<", ">", "(", ")", "$",   "`",       "\\\"",
+                             "'", "\\\\", "#", "*", "?", "[", "~", "\\n", "\\u0001", "\\u007f"})
+        check({{request(std::string("7") + mark, "64"), refused, ""},
+               {request("7", std::string(mark) + '6'), refused, ""}});
+    EXPECT_EQ(20, daemon_->logged("syslogsize has a character that the shell would interpret, refused"));
+    check({{request(" 5 -x", "{%]=!"), reply(R"("sysloglevel":" 5 -x","syslogsize":"{%]=!")"),
+            script + " 5 -x -s {%]=! &\n"}});
     /* While the log is streamed, the values wait for the stream's end. */
     tool_->ask(stream_request("syslog", "start"));
     daemon_->commands();
@@ -97,6 +105,11 @@ TEST_F(Handlers, SetAndTellTheSystemLogsParameters)
            {stream_request("syslog", "end"), stream_reply("udp", "0", ""),
             "killall -9 syslogd\n" + script + "3 -s 99 &\n"}});
     EXPECT_EQ("3 99", get_nv("syslog_level") + ' ' + get_nv("syslog_size"));
+    set_nv("syslog_level", "7'"); /* kept by a daemon that refused nothing */
+    set_nv("syslog_size", ";reboot #");
+    check({{stream_request("syslog", "end"), stream_reply("udp", "0", ""),
+            "killall -9 syslogd\n" + script + " -s  &\n"}});
+    EXPECT_TRUE(daemon_->logs("syslog_size = [;reboot #] has a character that the shell would interpret, not used"));
 }
 
 TEST_F(Handlers, CapturePackets)
@@ -131,6 +144,8 @@ TEST_F(Handlers, KeepModuleLevels)
     start();
     EXPECT_EQ(0u,
               daemon_->commands().find(script + "old 1\n" + script + "usb err\nsh /usr/vex/vex_conf/scripts/vex_s"));
+    EXPECT_EQ(4, daemon_->logged("] is skipped"));
+    EXPECT_EQ(1, daemon_->logged("bsplog_module_level: [x,$(reboot)] is skipped"));
     tool_ = std::make_unique<tool_connection>();
     const auto request = [](const std::string &name, const std::string &level) {
         return R"({"msgid":"8","bsp":{"module_name":")" + name + R"(","level":")" + level + "\"}}";
@@ -146,7 +161,11 @@ TEST_F(Handlers, KeepModuleLevels)
     check({{request("usb", ""), reply("usb", "err", "Success"), ""},
            {request("nolevel", ""), reply("nolevel", "info", "Success"), ""},
            {request("", "debug"), reply("", "", "Fail:unkonw bsp module name"), ""},
-           {request("a;reboot", ""), refused, ""},
+           {request("a;reboot", ""), reply("a;reboot", "info", "Success"), ""},
+           {request(std::string(900, 'a'), ""), reply(std::string(900, 'a'), "info", "Success"), ""},
+           {request(std::string(901, 'a'), ""), refused, ""},
+           {request("a\\\"b", ""), refused, ""},
+           {request("a;reboot", "1"), refused, ""},
            {request("a\\u0000;b", "1"), kOnline, ""},
            {request("wlan", "$(id)"), refused, ""},
            {request(longest + "n", "1"), refused, ""},
@@ -161,6 +180,8 @@ TEST_F(Handlers, KeepModuleLevels)
     set_nv("bsplog_module_level", full);
     check({{request("m32", ""), reply("m32", "info", "Success"), ""}, set("new", "1")});
     EXPECT_EQ(full.substr(0, full.find("m32")) + "new,1;", get_nv("bsplog_module_level"));
+    EXPECT_EQ(1, daemon_->logged("bsplog_module_level has no room for new: only its first 32 entries are looked at"));
+    EXPECT_EQ(1, daemon_->logged("bsplog_module_level: [nolevel] has no level, dropped"));
     full.clear();
     for (int i = 0; i < 16; ++i)
         full.append(28, static_cast<char>('a' + i)).append(1, ',').append(30, '1').append(1, ';');
@@ -188,6 +209,8 @@ TEST_F(Handlers, UnpackAPackageAndStartItsScript)
     EXPECT_EQ(kTar, push(total, package.substr(60000))); /* cannot be unpacked: only the log says so */
     EXPECT_FALSE(exists("/logfs/logconf.tar"));
     EXPECT_LT(0, daemon_->logged("[cd /logfs/logconf/ && tar -xf /logfs/logconf.tar] System error3"));
+    EXPECT_EQ(1, daemon_->logged("logconf file has " + std::to_string(50000 + package.size()) + " bytes, " + total +
+                                 " were announced"));
     daemon_->commands();
     EXPECT_EQ(kTar, push(total, package.substr(0, 60000)));
     EXPECT_EQ(kTar, push(total, package.substr(60000)));

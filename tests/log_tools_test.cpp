@@ -131,8 +131,8 @@ TEST_F(Tools, OptionsChangeTheDaemonForGood)
     EXPECT_EQ(3, g_daemon.retry_count);
     const std::string longest(63, 'a'), too_long = longest + 'a';
     testing::internal::CaptureStderr();
-    parse({"-a", longest.c_str(), "-p", too_long.c_str(), "-a", too_long.c_str()});
-    EXPECT_EQ("--port: the argument is longer than 63 characters, ignored\n--address: the argument is longer than 63 "
+    parse({"-a", longest.c_str(), "-p", "0123456789abcdef", "-a", too_long.c_str()});
+    EXPECT_EQ("--port: the argument is longer than 15 characters, ignored\n--address: the argument is longer than 63 "
               "characters, ignored\n",
               testing::internal::GetCapturedStderr());
     EXPECT_EQ((items{{"log_manage_mode", "1"}, {"log_server_addr", longest}}), g_platform.items);
