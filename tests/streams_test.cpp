@@ -1,4 +1,5 @@
 #include "tests/daemon.h"
+#include "tests/frame.h"
 #include "tools/tool_device.h"
 #include "tools/tool_listener.h"
 #include "tools/tool_process.h"
@@ -605,9 +606,14 @@ TEST_F(Streams, LeaveTheLatestLocalLogBehind)
                   ask(R"({"msgid":"4","syslogParaSet":{"sysloglevel":")" + level + R"(","syslogsize":"64"}})"));
         EXPECT_TRUE(ends_clean(link));
         EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg", i + 1));
+        const std::string log_program =
+            "{syslogd} /bin/sh /usr/vex/override/syslogd -O /logfs/syslog -l " + level + " -s 64\n";
+        const std::string list = "busybox ps -o args | grep '[o]verride/syslogd'";
+        const auto until = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
+        while (run_command(list) != log_program && std::chrono::steady_clock::now() < until)
+            std::this_thread::yield();
         run_command("while busybox ps -o args | grep -q '[v]ex_syslog.sh'; do sleep 0.01; done");
-        EXPECT_EQ("{syslogd} /bin/sh /usr/vex/override/syslogd -O /logfs/syslog -l " + level + " -s 64\n",
-                  run_command("busybox ps -o args | grep '[o]verride/syslogd'"));
+        EXPECT_EQ(log_program, run_command(list)) << "nothing comes later";
         EXPECT_EQ("", run_command("timeout 10 sh -c 'until [ $(busybox pidof klogd | wc -w) = " +
                                   std::to_string(2 * i + 2) + " ]; do sleep 0.01; done' || echo ended"))
             << "what a script has started lives on";
@@ -681,10 +687,13 @@ TEST_F(Streams, RunCommandsWhoseRepliesAreLost)
     for (const bool tls : {false, true}) {
         call(tls, 0);
         const int count = 50;
-        std::string why;
-        let_fail({.call = kFaultSend, .only = 5000});
+        std::string commands; /* in one piece: what arrives behind a lost reply is lost as well */
         for (int i = 0; i < count; ++i)
-            EXPECT_TRUE(tool_send(*control_, R"({"msgid":"11","mode_lpm_online":"lpm"})", {}, why));
+            commands += frame(R"({"msgid":"11","mode_lpm_online":"lpm"})");
+        const int size = static_cast<int>(commands.size());
+        let_fail({.call = kFaultSend, .only = 5000});
+        EXPECT_EQ(size, tls ? SSL_write(control_->session.get(), commands.data(), size)
+                            : send(control_->fd.get(), commands.data(), commands.size(), MSG_NOSIGNAL));
         EXPECT_TRUE(daemon_->logs("modem mode = lpm", count)) << tls;
         hang_up();
     }
