@@ -99,7 +99,7 @@ __attribute__((constructor)) void load_board()
     unsetenv("LD_PRELOAD");
     dl_iterate_phdr(find_code, nullptr);
     const char *path = std::getenv("VEX_FAULTS");
-    const int fd = path == nullptr ? -1 : next(open, "open")(path, O_RDWR | O_CLOEXEC);
+    const int fd = path == nullptr ? -1 : open(path, O_RDWR | O_CLOEXEC);
     if (fd == -1)
         return;
     void *shared = mmap(nullptr, sizeof(fault_board), PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
@@ -171,9 +171,10 @@ int accept4(int fd, sockaddr *address, socklen_t *len, int flags)
                                                                         : real(fd, address, len, flags);
 }
 
-int open(const char *path, int flags, ...)
+/* Programs that are built for large files call these; the libraries of others, those of the plain names. */
+int open64(const char *path, int flags, ...)
 {
-    static auto *const real = next(open, "open");
+    static auto *const real = next(open64, "open64");
     va_list rest;
     va_start(rest, flags);
     const auto mode = (flags & O_CREAT) != 0 ? va_arg(rest, mode_t) : 0;
@@ -181,9 +182,9 @@ int open(const char *path, int flags, ...)
     return strikes(kFaultOpen) ? fails(kFaultOpen, -1, EMFILE) : real(path, flags, mode);
 }
 
-FILE *fopen(const char *path, const char *mode)
+FILE *fopen64(const char *path, const char *mode)
 {
-    static auto *const real = next(fopen, "fopen");
+    static auto *const real = next(fopen64, "fopen64");
     return strikes(kFaultOpen) ? fails<FILE *>(kFaultOpen, nullptr, EMFILE) : real(path, mode);
 }
 

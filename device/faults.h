@@ -15,7 +15,7 @@ enum fault_call {
     kFaultBind,
     kFaultListen,
     kFaultAccept, /* accept4 */
-    kFaultOpen,   /* open and fopen */
+    kFaultOpen,   /* open64 and fopen64 */
     kFaultFsync,
     kFaultSpawn, /* posix_spawn */
     kFaultSend,

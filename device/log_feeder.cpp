@@ -13,6 +13,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <poll.h>
@@ -77,7 +78,7 @@ void feed(int fd)
 int main(int argc, char **argv)
 {
     std::string pid_file = "/tmp/pid.";
-    pid_file += basename(argv[0]);
+    pid_file += std::filesystem::path(argv[0]).filename();
     for (int i = 1; i < argc; ++i) {
         if (std::strcmp(argv[i], "-k") == 0)
             return kill(std::stoi(contents(pid_file)), SIGKILL);

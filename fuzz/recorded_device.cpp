@@ -57,15 +57,18 @@ unsigned __wrap_sleep(unsigned)
     return 0;
 }
 void __wrap_sync() {}
-int __wrap_pthread_create(pthread_t *, const pthread_attr_t *, void *(*)(void *), void *)
-{
-    return EAGAIN;
-}
 }
 
-/* A start of a live log gets no threads: one of these two replaces what would make them. */
+/* A start of a live log gets no threads. A fuzzer has some of its own. */
 int refuse_thread(log_thread_task *task, void *argument) __asm__("__wrap__Z17log_thread_createP15log_thread_taskPv");
 int refuse_thread(log_thread_task *, void *)
+{
+    return -1;
+}
+
+int refuse_start(const char *starter, void *(*entry)(void *),
+                 void *argument) __asm__("__wrap__Z16log_start_threadPKcPFPvS1_ES1_");
+int refuse_start(const char *, void *(*)(void *), void *)
 {
     return -1;
 }

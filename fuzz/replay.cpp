@@ -21,7 +21,7 @@ namespace
 {
 
 constexpr auto kMutating = std::chrono::seconds(3);
-constexpr std::uint64_t kChances = 20260101;
+constexpr std::uint32_t kChances = 20260101;
 constexpr std::size_t kInputMax = 65536;
 constexpr unsigned kSeconds = 20; /* for one input; after that, the target hangs */
 
@@ -85,7 +85,7 @@ std::vector<std::string> read_seeds(int argc, char **argv)
 }
 
 /* Makes one change to an input, for which it may use a piece of another one. */
-void change(std::string &input, const std::string &other, std::mt19937_64 &chances)
+void change(std::string &input, const std::string &other, std::mt19937 &chances)
 {
     constexpr char kInteresting[] = {0, 1, 0x7f, '\x80', '\xff', '\n', '"', '\\', ';', ',', '~', '#'};
     const auto below = [&chances](std::size_t end) -> std::size_t { return end == 0 ? 0 : chances() % end; };
@@ -120,7 +120,7 @@ int main(int argc, char **argv)
         run();
     }
     const std::ptrdiff_t kept = count_descriptors(); /* a target may keep some from its first input on */
-    std::mt19937_64 chances{kChances};
+    std::mt19937 chances{kChances};
     const auto end = std::chrono::steady_clock::now() + kMutating;
     std::size_t tried = 0;
     for (; std::chrono::steady_clock::now() < end; ++tried) {
@@ -129,8 +129,7 @@ int main(int argc, char **argv)
             change(g_input, seeds[chances() % seeds.size()], chances);
         run();
     }
-    dprintf(STDERR_FILENO, "%zu seeds and %zu inputs made of them by the chances %llu\n", seeds.size(), tried,
-            static_cast<unsigned long long>(kChances));
+    dprintf(STDERR_FILENO, "%zu seeds and %zu inputs made of them by the chances %u\n", seeds.size(), tried, kChances);
     const std::ptrdiff_t left_open = count_descriptors() - kept;
     if (left_open != 0)
         dprintf(STDERR_FILENO, "the inputs left %td more descriptors open\n", left_open);

@@ -13,7 +13,7 @@ constexpr char kLogFile[] = "/tmp/daemon.log";
 constexpr char kNvFile[] = "/etc/vex/nvconfig";
 
 /* More than this, in kB, is a leak. */
-constexpr long kMemoryMax = kMemoryIsOurs ? 12 << 10 : 128 << 10;
+const long kMemoryMax = kMemoryIsOurs ? 12 << 10 : 128 << 10;
 
 /* Lines of NV items that commands and start-up write, with what those may hold. */
 constexpr char kChanging[] = "^(log_manage_switch=[0-9]+|log_manage_mode=[01]|log_server_addr=[0-9.:]*|"

@@ -9,6 +9,7 @@
 #include "device/operator.h"
 #include "platform/unique_fd.h"
 
+#include <cstdlib>
 #include <gtest/gtest.h>
 #include <memory>
 #include <string>
@@ -18,11 +19,12 @@
 
 constexpr int kPatience = 30000; /* milliseconds */
 
-/* Whether a daemon's memory tells of leaks: sanitizers keep books of their own, and what was freed. */
+/* Whether a daemon's memory tells of leaks: sanitizers keep books of their own, and what was freed; an emulator keeps
+ * what it has translated. */
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr bool kMemoryIsOurs = false;
 #else
-constexpr bool kMemoryIsOurs = true;
+inline const bool kMemoryIsOurs = std::getenv("VEX_EMULATED") == nullptr;
 #endif
 
 /* A log tool's connection to 127.0.0.1 or ::1. */

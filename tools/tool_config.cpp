@@ -66,7 +66,8 @@ bool push_pieces(tool_device &device, int fd, std::uint64_t total, push_state &s
     unsigned char buffer[kPieceSize];
     for (std::uint64_t left = total; left > 0;) {
         errno = 0;
-        const auto piece = read_piece(fd, std::span(buffer).first(std::min<std::uint64_t>(left, kPieceSize)));
+        const auto size = static_cast<std::size_t>(std::min<std::uint64_t>(left, kPieceSize));
+        const auto piece = read_piece(fd, std::span(buffer).first(size));
         if (piece.empty()) {
             state.status = kNoAnswer;
             state.why =

@@ -1,0 +1,25 @@
+# What the toolchain files have in common: Debian's cross compiler, and the libraries that cmake/foreign_root has unpacked
+# into VEX_FOREIGN_ROOT.
+set(CMAKE_SYSTEM_NAME Linux)
+set(CMAKE_CXX_COMPILER ${VEX_TRIPLET}-g++)
+set(CMAKE_LIBRARY_ARCHITECTURE ${VEX_TRIPLET})
+set(CMAKE_TRY_COMPILE_PLATFORM_VARIABLES VEX_FOREIGN_ROOT)
+
+if(NOT VEX_FOREIGN_ROOT)
+  message(FATAL_ERROR "Where are the libraries for ${VEX_TRIPLET}? Give their folder as VEX_FOREIGN_ROOT; "
+    "cmake/foreign_root makes one.")
+endif()
+set(CMAKE_FIND_ROOT_PATH ${VEX_FOREIGN_ROOT})
+set(CMAKE_FIND_ROOT_PATH_MODE_PROGRAM NEVER)
+set(CMAKE_FIND_ROOT_PATH_MODE_LIBRARY ONLY)
+set(CMAKE_FIND_ROOT_PATH_MODE_INCLUDE ONLY)
+set(CMAKE_FIND_ROOT_PATH_MODE_PACKAGE ONLY)
+set(ENV{PKG_CONFIG_SYSROOT_DIR} ${VEX_FOREIGN_ROOT})
+set(ENV{PKG_CONFIG_LIBDIR} ${VEX_FOREIGN_ROOT}/usr/lib/${VEX_TRIPLET}/pkgconfig:${VEX_FOREIGN_ROOT}/usr/share/pkgconfig)
+
+set(CMAKE_CXX_STANDARD_INCLUDE_DIRECTORIES ${VEX_FOREIGN_ROOT}/usr/include ${VEX_FOREIGN_ROOT}/usr/include/${VEX_TRIPLET})
+# The libraries of libraries, which the linker looks up by itself.
+set(CMAKE_EXE_LINKER_FLAGS_INIT
+  "-Wl,-rpath-link,${VEX_FOREIGN_ROOT}/lib/${VEX_TRIPLET}:${VEX_FOREIGN_ROOT}/usr/lib/${VEX_TRIPLET}")
+set(CMAKE_MODULE_LINKER_FLAGS_INIT ${CMAKE_EXE_LINKER_FLAGS_INIT})
+set(CMAKE_CROSSCOMPILING_EMULATOR ${VEX_EMULATOR};-L;${VEX_FOREIGN_ROOT})
