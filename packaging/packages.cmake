@@ -1,0 +1,27 @@
+# Debian packages, one a component: cpack --config build/CPackConfig.cmake
+set(CPACK_GENERATOR DEB)
+set(CPACK_PACKAGE_CONTACT "The vex_log_manage maintainers <maintainers@localhost>")
+set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
+set(CPACK_STRIP_FILES ON)
+set(CPACK_COMPONENTS_ALL daemon)
+if(VEX_TOOL)
+  list(APPEND CPACK_COMPONENTS_ALL tool)
+endif()
+set(CPACK_DEB_COMPONENT_INSTALL ON)
+set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
+set(CPACK_DEBIAN_PACKAGE_SHLIBDEPS ON)
+set(CPACK_DEBIAN_COMPRESSION_TYPE xz)
+
+set(CPACK_DEBIAN_DAEMON_PACKAGE_NAME vex-log-manage)
+set(CPACK_DEBIAN_DAEMON_PACKAGE_SECTION admin)
+set(CPACK_COMPONENT_DAEMON_DESCRIPTION
+  "control and collection of a device's diagnostic logs\nRuns on the device and serves a log tool, or calls its log server.")
+set(CPACK_DEBIAN_DAEMON_PACKAGE_DEPENDS libssl3) # which it loads by name
+set(CPACK_DEBIAN_DAEMON_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/packaging/debian/postinst
+  ${PROJECT_SOURCE_DIR}/packaging/debian/prerm)
+
+set(CPACK_DEBIAN_TOOL_PACKAGE_NAME vex-log-tool)
+set(CPACK_DEBIAN_TOOL_PACKAGE_SECTION net)
+set(CPACK_COMPONENT_TOOL_DESCRIPTION
+  "controls and collects the diagnostic logs of a device\nThe PC side of vex-log-manage.")
+include(CPack)
