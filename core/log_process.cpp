@@ -3,9 +3,11 @@
 #include "core/log_tools.h"
 
 #include <csignal>
+#include <cstdlib>
 #include <dirent.h>
 #include <fcntl.h>
 #include <malloc.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 namespace
@@ -20,8 +22,14 @@ void open_standard_streams()
         close(fd);
 }
 
+/* At once where the kernel can, which needs no /proc. */
 void close_inherited_on_exec()
 {
+#ifdef SYS_close_range
+    constexpr unsigned kOnExec = 4; /* CLOSE_RANGE_CLOEXEC, which some headers lack */
+    if (syscall(SYS_close_range, STDERR_FILENO + 1, ~0U, kOnExec) == 0)
+        return;
+#endif
     DIR *open_fds = opendir("/proc/self/fd");
     if (open_fds == nullptr)
         return;
@@ -44,6 +52,17 @@ void keep_freed_memory()
 void keep_freed_memory() {}
 #endif
 
+/* A starter may have blocked signals or ignored them, which programs inherit: SIGTERM has to end them and this process, and
+ * SIGCHLD to tell how they end. SIGHUP is left as it is: nohup ignores it on purpose. */
+void take_signals()
+{
+    sigset_t none;
+    sigemptyset(&none);
+    sigprocmask(SIG_SETMASK, &none, nullptr);
+    signal(SIGTERM, SIG_DFL);
+    signal(SIGCHLD, SIG_DFL);
+}
+
 /* Unlike SIG_IGN, a handler is not inherited by the programs that the daemon starts. */
 void on_broken_pipe(int /*signal*/) {}
 
@@ -54,10 +73,11 @@ void log_prepare_process()
     open_standard_streams();
     close_inherited_on_exec();
     keep_freed_memory();
+    setenv("LC_ALL", "C", 1);
+    take_signals();
     struct sigaction action {
     };
     action.sa_handler = on_broken_pipe;
     action.sa_flags = SA_RESTART;
     sigaction(SIGPIPE, &action, nullptr);
-    signal(SIGCHLD, SIG_DFL); /* a starter that ignored it would keep us from learning how our programs end */
 }

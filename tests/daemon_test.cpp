@@ -142,6 +142,27 @@ TEST_F(Daemon, LeavesNothingOpenInTheProgramsItStarts)
     EXPECT_EQ(kOnline, tool_connection().ask(kAskMode));
 }
 
+/* Whatever its starter made of signals and the locale, and without /proc, which tells what is open. */
+TEST_F(Daemon, OwesNothingToItsStarter)
+{
+    const std::string hide_proc = kMemoryIsOurs ? "umount -l /proc; " : ""; /* sanitizers and emulators need it */
+    install_program("vex_log_manage",
+                    "trap '' TERM CHLD\nexport LC_ALL=de_DE.UTF-8\nexec 9>/tmp/left_open\nexec unshare -m sh -c '" +
+                        hide_proc + "exec /usr/vex/bin/vex_log_manage'");
+    install_program("df", "{ echo $LC_ALL; sh -c 'kill $$; echo survives'; } >/tmp/told 2>&1\necho leaks >&9");
+    sigset_t all;
+    sigset_t before;
+    sigfillset(&all);
+    sigprocmask(SIG_SETMASK, &all, &before);
+    start();
+    sigprocmask(SIG_SETMASK, &before, nullptr);
+    EXPECT_NE("(closed)", tool_connection().ask(kAskVersion));
+    EXPECT_EQ("C\nTerminated\n", read_file("/tmp/told"));
+    EXPECT_EQ("", read_file("/tmp/left_open"));
+    kill(daemon_->pid, SIGTERM);
+    EXPECT_EQ(-1, daemon_->wait_exit()) << "by the signal";
+}
+
 TEST_F(Daemon, KeepsNothingOfThreeHundredTools)
 {
     start();
