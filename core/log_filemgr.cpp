@@ -1,6 +1,7 @@
 #include "core/log_filemgr.h"
 
 #include "core/log_line.h"
+#include "core/log_tools.h"
 
 #include <cerrno>
 #include <climits>
@@ -125,6 +126,15 @@ int pel_remove_file(const char *path)
     if (log_is_file_exist(path) == 0)
         return 1;
     return std::remove(path) == 0 ? 1 : 0;
+}
+
+bool log_clear_path(const char *path)
+{
+    if (unlink(path) == 0 || errno == ENOENT)
+        return true;
+    char cmd[128];
+    std::snprintf(cmd, sizeof cmd, "rm -rf %s", path);
+    return log_exec_cmd(cmd) == 0;
 }
 
 int pel_rename_file(const char *old_path, const char *new_path)

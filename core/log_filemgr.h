@@ -56,6 +56,10 @@ int log_seek_file(FILE *stream, std::int32_t offset, int origin);
 /* Removes a file or an empty folder (logged). 1 when it is gone or never was, 0 when it stays. */
 int pel_remove_file(const char *path);
 
+/* Removes whatever is at the path: a link itself, a folder with all in it (by a command). True when nothing is left
+ * there; the path has up to 100 characters. */
+bool log_clear_path(const char *path);
+
 /* 1 renamed, 0 not; a missing path is logged. */
 int pel_rename_file(const char *old_path, const char *new_path);
 

@@ -137,8 +137,12 @@ static_assert(sizeof(log_ipc_msg) == 1036);
  * refused or failed (logged): a code above kMsgCmdMax, a payload above kMsgDataMax, or nobody there. */
 int log_send_msg(int dst_module, int msg_cmd, const void *payload, int len);
 
+/* Whether the other end of a connected unix socket was made by a process of our own user. */
+bool log_peer_is_ours(int fd);
+
 /* Connects to the unix stream socket at `path`, which is not null. Returns the non-blocking, close-on-exec socket, with
- * a send time-out of 3 seconds; the caller closes it. -1 on failure (logged). */
+ * a send time-out of 3 seconds; the caller closes it. -1 on failure, or when another user listens there
+ * (logged). */
 int log_connect_unix_socket(const char *path);
 
 #endif

@@ -27,6 +27,13 @@ void log_set_keepalive(int fd)
         setsockopt(fd, setting.level, setting.option, &setting.value, sizeof setting.value);
 }
 
+bool log_peer_is_ours(int fd)
+{
+    ucred peer{};
+    socklen_t len = sizeof peer;
+    return getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &peer, &len) == 0 && peer.uid == geteuid();
+}
+
 int log_connect_unix_socket(const char *path)
 {
     unique_fd sock{socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)};
@@ -40,6 +47,10 @@ int log_connect_unix_socket(const char *path)
     std::memcpy(to.sun_path, path, strnlen(path, sizeof to.sun_path));
     if (connect(sock.get(), reinterpret_cast<const sockaddr *>(&to), sizeof to) != 0) {
         LOG_FAULT("can not connect to:%s, errno: %d, pid=%d", path, errno, static_cast<int>(getpid()));
+        return -1;
+    }
+    if (!log_peer_is_ours(sock.get())) {
+        LOG_FAULT("another user listens at:%s, pid=%d", path, static_cast<int>(getpid()));
         return -1;
     }
     const timeval send_timeout{3, 0};

@@ -5,13 +5,14 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <pthread.h>
+#include <fstream>
 #include <spawn.h>
 #include <string_view>
 #include <unistd.h>
 
 device_traits g_device{0};
 std::string g_output;
+std::string g_archive;
 
 namespace
 {
@@ -31,6 +32,8 @@ int __wrap_posix_spawn(pid_t *child, const char *, const posix_spawn_file_action
     if (line.starts_with(kTakesItsPlace))
         line.remove_prefix(kTakesItsPlace.size());
     promise(line.size() <= kCommandMax, "a command line has room in its buffer");
+    if (line.starts_with("tar -czvf "))
+        std::ofstream("/tmp/MBBlogfs.tar.gz", std::ios::binary) << g_archive;
     *child = 1;
     return 0;
 }

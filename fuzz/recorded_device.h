@@ -24,6 +24,7 @@ struct device_traits {
 };
 
 extern device_traits g_device;
-extern std::string g_output; /* of its programs */
+extern std::string g_output;  /* of its programs */
+extern std::string g_archive; /* that tar makes */
 
 #endif

@@ -4,7 +4,11 @@
 #include "core/log_tools.h"
 #include "handlers/handlers.h"
 #include "handlers/log_handler.h"
+#include "platform/unique_fd.h"
 #include "protocol/log_pkg_send.h"
+
+#include <cerrno>
+#include <fcntl.h>
 
 namespace
 {
@@ -39,9 +43,22 @@ void make_room()
     LOG_NOTE("%s:God !!! the space of %s is no enough, del syslog file \n", kName, kLogDir);
 }
 
+/* Puts an empty archive of our own in place, for tar to write into: others can neither read it nor lay something there
+ * beforehand. */
+bool create_archive()
+{
+    const unique_fd archive{
+        log_clear_path(kArchive) ? open(kArchive, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600) : -1};
+    if (!archive)
+        LOG_FAULT("%s: can not create %s, errno: %d\n", kName, kArchive, errno);
+    return static_cast<bool>(archive);
+}
+
 /* Packs the log partition. The archive's size; 0 or less when there is none to be sent. */
 std::int32_t pack()
 {
+    if (!create_archive())
+        return 0;
     char cmd[256];
     std::snprintf(cmd, sizeof cmd, "tar -czvf %s %s", kArchive, kLogDir);
     LOG_NOTE("%s:[%s] start\n", kName, cmd);

@@ -258,7 +258,7 @@ TEST_F(Handlers, SendTheLogArchive)
         install_program("tar", tar);
         EXPECT_EQ(kNotPacked, tool_->ask(kGetArchive)) << tar;
     }
-    install_program("tar", "mkdir $2"); /* something that cannot be read: no piece follows */
+    install_program("tar", "rm $2; mkdir $2"); /* something that cannot be read: no piece follows */
     tool_->send(frame(kGetArchive) + frame(kAskMode));
     EXPECT_EQ(kOnline, tool_->receive());
     EXPECT_EQ(1, daemon_->logged("log_msg_get_log_file:send data fail"));
@@ -271,6 +271,25 @@ TEST_F(Handlers, SendTheLogArchive)
     }
     check({{R"({"msgid":"7","CleanLocalLog":"no"})", R"({"msgid":"7","CleanLocalLog":"","Result":"Success"})",
             "rm -rf /logfs/*\n"}});
+}
+
+/* Whatever another user has laid in its place. */
+TEST_F(Handlers, MakeTheLogArchiveTheirOwn)
+{
+    install_program("tar", "stat -c '%a %h %F' $2 >/tmp/stat; echo logs >$2");
+    connect();
+    for (const char *laid : {"ln -s /tmp/file $archive", "ln file $archive; chmod 666 file", "mkdir -p $archive/folder",
+                             "mkfifo $archive", "ln -s / $archive"}) {
+        run_command("cd /tmp; echo old >file; archive=MBBlogfs.tar.gz; " + std::string(laid));
+        tool_->send(frame(kGetArchive));
+        std::string data;
+        EXPECT_EQ(result(R"({"msgid":"2","GetLocalLog":{"totalLength":"5"})", "Success"), tool_->receive(&data))
+            << laid;
+        EXPECT_EQ("logs\n", data) << laid;
+        EXPECT_EQ("600 1 regular empty file\n", read_file("/tmp/stat")) << laid;
+        EXPECT_EQ("old\n", read_file("/tmp/file")) << laid;
+        EXPECT_EQ(kOnline, tool_->ask(kAskMode));
+    }
 }
 
 TEST_F(Handlers, StopAnArchiveWhoseToolIsReplaced)

@@ -329,7 +329,9 @@ TEST_F(Streams, MayFailToBegin)
              std::tuple{fault{.call = kFaultThread}, "vex_log_recv_syslog_thread  FAIL", true},
              {{.call = kFaultThread, .pass = 1}, "vex_log_client_syslog_thread  FAIL", false},
              {{.call = kFaultSocket, .only = AF_UNIX}, "can not create socket. errno: 24", true},
-             {{.call = kFaultBind, .only = AF_UNIX}, "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
+             {{.call = kFaultBind, .times = 10, .only = AF_UNIX},
+              "can not bind socket :/tmp/MSG_ID_SYSLOG, errno: 98",
+              true},
              {{.call = kFaultListen, .only = AF_UNIX}, "can not listen socket :/tmp/MSG_ID_SYSLOG, errno: 98", true},
              {{.call = kFaultSocket, .only = AF_INET}, "Error calling socket: Too many open files, errno: 24", false},
          }) {
@@ -382,6 +384,7 @@ TEST_F(Streams, AreNotBegunWithoutWhatTheirProgramsNeed)
     confirm(*control_, kSyslog); /* there is no link */
     EXPECT_EQ(kOnline, ask(kAskMode));
     EXPECT_EQ("", daemon_->commands());
+    run_command("mkdir -p /tmp/MSG_ID_SYSLOG/folder"); /* of somebody who means to be in the way */
     tool_link links[] = {start(kSyslog), start(kModem)};
     daemon_->commands();
     let_fail({.call = kFaultSocket, .only = AF_UNIX});
@@ -403,6 +406,7 @@ TEST_F(Streams, AreNotBegunWithoutWhatTheirProgramsNeed)
     EXPECT_TRUE(daemon_->logs("&] System error1")) << "the program could not be started";
     confirm(links[0], kSyslog); /* no syslogd is there to be killed */
     EXPECT_EQ(std::pair(true, feed_.size()), take(links[0], feed_.size()));
+    EXPECT_EQ("600 socket\n", run_command("stat -c '%a %F' /tmp/MSG_ID_SYSLOG"));
     EXPECT_NE(0, daemon_->logged("[killall -9 syslogd] System error3"));
     hang_up();
 }

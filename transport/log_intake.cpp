@@ -1,12 +1,15 @@
 #include "transport/log_intake.h"
 
+#include "core/log_filemgr.h"
 #include "core/log_line.h"
 #include "core/log_link.h"
+#include "core/log_tools.h"
 
 #include <cerrno>
 #include <cstring>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/un.h>
 #include <unistd.h>
 #include <utility>
@@ -14,6 +17,27 @@
 constexpr char kLogSource[] = "vex_log_manage";
 
 constexpr int kBacklog = 1;
+constexpr int kBindMax = 10; /* somebody else may be quicker at the path */
+
+namespace
+{
+
+/* Puts the socket at the path, whatever is there; only our own user may connect to it. */
+int bind_alone(int sock, const char *path)
+{
+    sockaddr_un at{};
+    at.sun_family = AF_UNIX;
+    std::memcpy(at.sun_path, path, strnlen(path, sizeof at.sun_path - 1));
+    fchmod(sock, 0600);
+    for (int i = 0; i < kBindMax; ++i) {
+        log_clear_path(path); /* what an earlier intake left behind */
+        if (bind(sock, reinterpret_cast<const sockaddr *>(&at), sizeof at) == 0)
+            return 0;
+    }
+    return -1;
+}
+
+} // namespace
 
 int vex_create_unix_server_socket(const char *path, unique_fd *listener)
 {
@@ -27,11 +51,7 @@ int vex_create_unix_server_socket(const char *path, unique_fd *listener)
         LOG_FAULT("can not create socket. errno: %d", errno);
         return -1;
     }
-    sockaddr_un at{};
-    at.sun_family = AF_UNIX;
-    std::memcpy(at.sun_path, path, strnlen(path, sizeof at.sun_path - 1));
-    unlink(path); /* what an earlier intake left behind */
-    if (bind(sock.get(), reinterpret_cast<const sockaddr *>(&at), sizeof at) != 0) {
+    if (bind_alone(sock.get(), path) != 0) {
         LOG_FAULT("can not bind socket :%s, errno: %d", path, errno);
         return -1;
     }
@@ -54,6 +74,10 @@ void log_server_handle_realtimelog(unique_fd listener, int log_type, int stop_fd
     const unique_fd program{accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC)};
     if (!program) {
         LOG_FAULT("can not accept client, errno: %d", errno);
+        return;
+    }
+    if (!log_peer_is_ours(program.get())) {
+        LOG_FAULT("%s: log_type[%d] refuses another user's program\n", __func__, log_type);
         return;
     }
     LOG_NOTE("%s: client fd=[%d] log_type[%d] connect", __func__, program.get(), log_type);
