@@ -64,11 +64,7 @@ void *log_client_ctl_thread_proc(void *)
     LOG_NOTE("enter %s.\n", __func__);
     serve_link();
     LOG_NOTE("vex_log_manage exit \n");
-    {
-        const log_lock hold{g_daemon.exit_lock};
-        g_daemon.exit_flag = 1;
-    }
-    g_daemon.exit_change.notify_all(); /* last: the process may end before this thread does anything more */
+    log_end_process(0);
     return nullptr;
 }
 

@@ -20,7 +20,8 @@ struct log_daemon_state {
     std::atomic<int> syslog_realtime_on{0}; /* 1 while the system log is streamed instead of kept on the device */
 
     log_mutex exit_lock;
-    int exit_flag LOG_GUARDED_BY(exit_lock) = 0; /* set to 1 to end the process */
+    int exit_flag LOG_GUARDED_BY(exit_lock) = 0; /* set to 1 to end the process: log_end_process() */
+    int exit_status LOG_GUARDED_BY(exit_lock) = 0;
     std::condition_variable exit_change;
 
     /* Bytes of the configuration package that have arrived since the last one was complete or the count was reset. It
@@ -34,5 +35,8 @@ struct log_daemon_state {
 };
 
 extern log_daemon_state g_daemon;
+
+/* Has the process end with that status, from any thread. It may end before the call returns. */
+void log_end_process(int status);
 
 #endif

@@ -248,11 +248,17 @@ int vex_popen(const char *cmd, char *buffer, int size)
     }
     std::memset(buffer, 0, static_cast<std::size_t>(std::max(size, 0)));
     int ends[2];
-    if (is_skipped(cmd) || pipe2(ends, O_CLOEXEC) != 0)
+    if (is_skipped(cmd))
         return 0;
+    if (pipe2(ends, O_CLOEXEC) != 0) {
+        LOG_FAULT("vex_popen: no pipe for [%s], errno: %d\n", cmd, errno);
+        return 0;
+    }
     unique_fd output{ends[0]};
     unique_fd input{ends[1]};
     const pid_t shell = start_shell(cmd, true, -1, input.get());
+    if (shell == -1)
+        LOG_FAULT("vex_popen: [%s] cannot be started\n", cmd);
     input.reset(); /* the shell has its own: the line ends with the programs that write it */
     const int len = read_line(output.get(), buffer, size - 1);
     output.reset();

@@ -10,11 +10,15 @@
 #include "core/log_programs.h"
 #include "core/log_tools.h"
 #include "handlers/bsp_module_level.h"
+#include "platform/unique_fd.h"
 #include "transport/log_server.h"
 
 #include <charconv>
 #include <cstdio>
 #include <cstring>
+#include <fcntl.h>
+#include <optional>
+#include <sys/file.h>
 #include <unistd.h>
 
 namespace
@@ -25,9 +29,24 @@ constexpr char kLogSource[] = "vex_log_manage";
 constexpr auto kExitPoll =
     std::chrono::seconds(5); /* between two looks at exit_flag, which is also told when it is set */
 
+constexpr auto kCounterMax = std::chrono::seconds(5); /* for another daemon to be done with the start counter */
+constexpr useconds_t kCounterPoll = 1000;             /* microseconds */
+
+/* So that two daemons that start at once take two units. The lock is on their own program, as that needs no file; one
+ * that cannot be had in time is done without. */
+unique_fd lock_counter()
+{
+    unique_fd program{open("/proc/self/exe", O_RDONLY | O_CLOEXEC)};
+    const auto end = log_clock::now() + kCounterMax;
+    while (program && flock(program.get(), LOCK_EX | LOCK_NB) != 0 && log_clock::now() < end)
+        usleep(kCounterPoll);
+    return program;
+}
+
 /* Takes one unit of the start counter; false when there is none left and the daemon is to stay off. */
 bool consume_start()
 {
+    const unique_fd lock = lock_counter();
     char count[8] = {};
     vex_get_nv_item("log_manage_switch", count, sizeof count);
     const int starts = log_text_to_int(count);
@@ -68,14 +87,14 @@ int run_client_mode()
     return 0;
 }
 
-/* Waits until the process is to end, for a while; whether it is. */
-bool is_ending()
+/* Waits until the process is to end, for a while; then its status. */
+std::optional<int> exit_status()
 {
     const auto end = log_clock::now() + kExitPoll;
     const log_lock hold{g_daemon.exit_lock};
     while (g_daemon.exit_flag == 0 && log_clock::now() < end)
         g_daemon.exit_lock.wait_until(g_daemon.exit_change, end);
-    return g_daemon.exit_flag != 0;
+    return g_daemon.exit_flag != 0 ? std::optional{g_daemon.exit_status} : std::nullopt;
 }
 
 } // namespace
@@ -94,9 +113,10 @@ int main(int argc, char **argv)
         run_server_mode();
     else if (const int status = run_client_mode(); status != 0)
         return status;
-    while (!is_ending())
+    std::optional<int> status;
+    while (!(status = exit_status()))
         log_reap_programs();
     log_streams_end_all();
     std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
-    _exit(0);            /* other threads still run: nothing that they use may be torn down */
+    _exit(*status);      /* other threads still run: nothing that they use may be torn down */
 }

@@ -50,6 +50,26 @@ TEST_F(Faults, EndTheListenerThatTheyHitAndNoOther)
     }
 }
 
+TEST_F(Faults, OfBothListenersEndTheDaemon)
+{
+    for (const auto &what : {fault{.call = kFaultSocket, .times = 2}, fault{.call = kFaultThread, .times = 2}}) {
+        let_fail(what);
+        daemon_process daemon;
+        EXPECT_EQ(1, daemon.wait_exit());
+        EXPECT_EQ(1, daemon.logged("nobody can connect, on IPv4 or IPv6: vex_log_manage exit "));
+    }
+    let_fail({.call = kFaultSocket, .times = 0});
+    set_nv("log_manage_switch", "50");
+    start();
+    daemon_process second; /* its port is taken */
+    EXPECT_EQ(1, second.wait_exit());
+    EXPECT_EQ(kOnline, tool_connection().ask(kAskMode));
+    EXPECT_EQ("48", get_nv("log_manage_switch"));
+    set_nv("log_manage_mode", "7"); /* which ends at once */
+    run_command("for i in $(seq 8); do vex_log_manage & vex_log_manage; wait; done >/dev/null");
+    EXPECT_EQ("32", get_nv("log_manage_switch")) << "each start takes its own";
+}
+
 TEST_F(Faults, LeaveAConnectionWithoutAReaderToTheNextTool)
 {
     start();

@@ -1,15 +1,18 @@
 #include "device/operator.h"
+#include "platform/unique_fd.h"
 #include "platform/vex_platform.h"
 
 #include <atomic>
 #include <cerrno>
 #include <ctime>
+#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <gtest/gtest.h>
 #include <random>
 #include <sched.h>
 #include <sstream>
+#include <sys/file.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/wait.h>
@@ -48,6 +51,33 @@ protected:
     std::string dir_;
     std::string nv_;
 };
+
+/* Nothing is waited for, whatever has the file's name or the one beside it, and it is told once. */
+TEST_F(HostPlatform, NvFileThatCannotBeUsedIsTold)
+{
+    const auto told = [this](const std::string &what) {
+        return run_command("cd " + dir_ + "; grep -c 'nvconfig: .*" + what + "' log; : >log; rm -rf nvconfig*");
+    };
+    for (const auto &[prepare, what] : {std::pair{"mkfifo nvconfig", "is not a plain file"},
+                                        {"mkdir nvconfig", "is not a plain file"},
+                                        {"truncate -s 1G nvconfig", "more than 1 MB"},
+                                        {"echo a=1 >nvconfig; mkdir nvconfig.new", "cannot be written"}}) {
+        run_command("cd " + dir_ + "; rm -rf nvconfig*; " + prepare);
+        ASSERT_EQ(1, vex_nvconfig_write("b", "2", 1));
+        EXPECT_EQ(-1, cfg_save()) << prepare;
+        EXPECT_EQ(-1, cfg_save()) << prepare;
+        EXPECT_EQ("2", get("b")) << "for as long as the process lives";
+        EXPECT_EQ("1\n", told(what)) << prepare;
+        EXPECT_EQ(0, cfg_save());
+        EXPECT_EQ("2", get("b"));
+    }
+    const unique_fd lock{open((nv_ + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600)};
+    ASSERT_EQ(0, flock(lock.get(), LOCK_EX));
+    ASSERT_EQ(1, vex_nvconfig_write("b", "3", 1));
+    EXPECT_EQ(-1, cfg_save());
+    EXPECT_EQ("1\n", told("lock file cannot be had"));
+    EXPECT_EQ(0, cfg_save());
+}
 
 TEST_F(HostPlatform, NvCommitKeepsWhatItDoesNotChangeAndWaitsForRoom)
 {

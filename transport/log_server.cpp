@@ -1,5 +1,6 @@
 #include "transport/log_server.h"
 
+#include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_registry.h"
 #include "core/log_tools.h"
@@ -7,6 +8,7 @@
 #include "protocol/log_recv.h"
 
 #include <arpa/inet.h>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -23,6 +25,9 @@ constexpr char kLogSource[] = "vex_log_manage";
 constexpr int kPort = 48888;
 constexpr int kBacklog = 1;
 constexpr unsigned kAcceptPause = 1; /* seconds after a failed accept */
+constexpr int kNoListener = 1;       /* the process's status */
+
+std::atomic<int> g_families{2}; /* that have a listener, or may get one */
 
 /* A listener's address family and its words; a line that is empty is not logged. */
 struct listener_family {
@@ -255,26 +260,45 @@ void run_listener(const char *body, const listener_family &words)
         handle_tcp_msg(words, listener.get());
 }
 
+/* A family has no listener. Without any, nobody would ever reach the daemon. */
+void lose_family()
+{
+    if (--g_families > 0)
+        return;
+    LOG_FAULT("nobody can connect, on IPv4 or IPv6: vex_log_manage exit \n");
+    log_end_process(kNoListener);
+}
+
 void *log_server_thread_proc(void * /*unused*/)
 {
     run_listener(__func__, kIpv4);
+    lose_family();
     return nullptr;
 }
 
 void *log_server_thread_proc_ipv6(void * /*unused*/)
 {
     run_listener(__func__, kIpv6);
+    lose_family();
     return nullptr;
+}
+
+int start_listener(const char *starter, void *(*entry)(void *))
+{
+    const int result = log_start_thread(starter, entry, nullptr);
+    if (result != 0)
+        lose_family();
+    return result;
 }
 
 } // namespace
 
 int vex_log_server_thread()
 {
-    return log_start_thread(__func__, log_server_thread_proc);
+    return start_listener(__func__, log_server_thread_proc);
 }
 
 int vex_log_server_thread_ipv6()
 {
-    return log_start_thread(__func__, log_server_thread_proc_ipv6);
+    return start_listener(__func__, log_server_thread_proc_ipv6);
 }

@@ -13,7 +13,7 @@
 #define TRANSPORT_LOG_SERVER_H
 
 /* Start the listener of one address family, for the life of the process. 0 started, -1 not (logged). A family
- * whose port cannot be had stays without a listener. */
+ * whose port cannot be had stays without a listener; without both, the process ends with status 1 (logged). */
 int vex_log_server_thread();
 int vex_log_server_thread_ipv6();
 

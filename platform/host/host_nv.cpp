@@ -12,6 +12,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -30,7 +31,12 @@ struct nv_item {
     std::string value;
 };
 
+constexpr off_t kSizeMax = 1 << 20;
+constexpr auto kLockMax = std::chrono::seconds(5);
+constexpr useconds_t kLockPoll = 1000; /* microseconds */
+
 std::mutex g_mutex;
+const char *g_told = ""; /* what was wrong with the file last, and is told; under g_mutex */
 
 /* What was written since the last commit. Never destroyed: threads may use it while the process exits. */
 std::vector<nv_item> &uncommitted()
@@ -49,22 +55,47 @@ const std::string &nv_path()
     return *path;
 }
 
-/* Reads the whole file into `text`. A file that is not there is empty; false when it is there but can't be
- * read. */
+/* Logs what is wrong with the file, when that is something else than before; false. Under g_mutex. */
+bool complain(const char *what)
+{
+    if (std::strcmp(g_told, what) != 0)
+        vex_syslog_append(0, "host_nv", __LINE__, 0, "%s: %s", nv_path().c_str(), what);
+    g_told = what;
+    return false;
+}
+
+/* Reads the whole file into `text`. A file that is not there is empty; false, and told, when it is there but can't be
+ * read. One that is no plain file, or huge, is not waited for. */
 bool read_text(const std::string &path, std::string &text)
 {
-    const unique_fd fd{open(path.c_str(), O_RDONLY | O_CLOEXEC)};
+    const unique_fd fd{open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC)};
     if (!fd)
-        return errno == ENOENT;
+        return errno == ENOENT || complain("cannot be opened");
+    struct stat status {
+    };
+    if (fstat(fd.get(), &status) != 0 || !S_ISREG(status.st_mode) || status.st_size > kSizeMax)
+        return complain("is not a plain file, or has more than 1 MB");
     char piece[4096];
     for (;;) {
         const ssize_t n = read(fd.get(), piece, sizeof piece);
         if (n == -1 && errno == EINTR)
             continue;
         if (n <= 0)
-            return n == 0;
+            return n == 0 || complain("cannot be read");
         text.append(piece, static_cast<std::size_t>(n));
     }
+}
+
+/* Waits for the lock of those that change the file, but not for ever. */
+bool lock_out_others(int fd)
+{
+    const auto end = std::chrono::steady_clock::now() + kLockMax;
+    while (flock(fd, LOCK_EX | LOCK_NB) != 0) {
+        if (std::chrono::steady_clock::now() >= end)
+            return false;
+        usleep(kLockPoll);
+    }
+    return true;
 }
 
 bool write_all(int fd, std::string_view text)
@@ -83,7 +114,7 @@ bool write_all(int fd, std::string_view text)
 /* Writes and syncs the new text beside `path`, with the owner and rights that the old file has. */
 bool write_beside(const std::string &path, const std::string &beside, std::string_view text)
 {
-    const unique_fd fd{open(beside.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644)};
+    const unique_fd fd{open(beside.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NONBLOCK | O_CLOEXEC, 0644)};
     if (!fd)
         return false;
     struct stat old {
@@ -106,8 +137,8 @@ bool commit(const std::vector<nv_item> &items)
 {
     const std::string &path = nv_path();
     const unique_fd lock{open((path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644)};
-    if (!lock || flock(lock.get(), LOCK_EX) != 0)
-        return false;
+    if (!lock || !lock_out_others(lock.get()))
+        return complain("its lock file cannot be had");
     std::string text;
     if (!read_text(path, text))
         return false;
@@ -116,7 +147,7 @@ bool commit(const std::vector<nv_item> &items)
     const std::string beside = path + ".new";
     if (!write_beside(path, beside, text) || std::rename(beside.c_str(), path.c_str()) != 0) {
         unlink(beside.c_str());
-        return false;
+        return complain("cannot be written");
     }
     return sync_folder_of(path);
 }
@@ -175,6 +206,7 @@ try {
     if (!commit(items)) /* a full disk, say: the items stay for the next commit, and reads see them */
         return -1;
     items.clear();
+    g_told = "";
     return 0;
 } catch (const std::bad_alloc &) {
     return -1;
