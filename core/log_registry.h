@@ -13,6 +13,7 @@
  *                        instructions: no waiting for a peer, sending, logging or starting of threads and programs
  *   a session's `lock_`  one library call on it (core/log_tls_session.h)
  *   exit_lock            whether the process is to end (core/daemon_state.h)
+ *   g_print_lock         lines on standard output (core/log_stdout.cpp); no waiting
  *   bsp_record_lock      one change of the record of kernel-module levels at a time (handlers/bsp_module_level.cpp)
  */
 #ifndef CORE_LOG_REGISTRY_H

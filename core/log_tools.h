@@ -81,7 +81,7 @@ int vex_popen(const char *cmd, char *buffer, int size);
 /*
  * Sends `len` bytes whole on the socket, or on the TLS session when the daemon runs over TLS. Returns `len`,
  * or -1 on the first failure, which is never retried; a negative length returns 0. Says on standard output,
- * not in the log, what became of it. The caller keeps other
+ * not in the log, what became of it (core/log_stdout.h). The caller keeps other
  * senders off the connection meanwhile.
  */
 int log_send_packet(int fd, log_tls_session *ssl, const void *buffer, int len);

@@ -1,8 +1,10 @@
 #include "core/log_tools.h"
 
 #include "core/daemon_state.h"
+#include "core/log_stdout.h"
 #include "core/log_tls_session.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
@@ -28,7 +30,15 @@ void print_sent(int len)
     std::memcpy(line, kWords, sizeof kWords - 1);
     char *const end = std::to_chars(line + sizeof kWords - 1, line + sizeof line, len).ptr;
     *end = '\n';
-    std::fwrite(line, 1, static_cast<std::size_t>(end + 1 - line), stdout);
+    log_print({line, end + 1});
+}
+
+void print_failure(int error)
+{
+    char line[128];
+    const int len =
+        std::snprintf(line, sizeof line, "log_send_packet data fail  errno= %d (%s)\n", error, std::strerror(error));
+    log_print({line, std::min(static_cast<std::size_t>(len), sizeof line - 1)});
 }
 
 } // namespace
@@ -43,7 +53,7 @@ int log_send_packet(int fd, log_tls_session *ssl, const void *buffer, int len)
             return -1;
         const int n = write_some(fd, ssl, static_cast<const char *>(buffer) + sent, len - sent);
         if (n <= 0) {
-            std::printf("log_send_packet data fail  errno= %d (%s)\n", errno, std::strerror(errno));
+            print_failure(errno);
             return -1;
         }
         sent += n;

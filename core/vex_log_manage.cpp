@@ -8,6 +8,7 @@
 #include "core/log_options.h"
 #include "core/log_process.h"
 #include "core/log_programs.h"
+#include "core/log_stdout.h"
 #include "core/log_tools.h"
 #include "handlers/bsp_module_level.h"
 #include "platform/unique_fd.h"
@@ -117,6 +118,6 @@ int main(int argc, char **argv)
     while (!(status = exit_status()))
         log_reap_programs();
     log_streams_end_all();
-    std::fflush(stdout); /* this one only: others may be locked by threads that read from programs */
-    _exit(*status);      /* other threads still run: nothing that they use may be torn down */
+    log_print_flush();
+    _exit(*status); /* other threads still run: nothing that they use may be torn down */
 }

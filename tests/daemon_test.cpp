@@ -163,6 +163,41 @@ TEST_F(Daemon, OwesNothingToItsStarter)
     EXPECT_EQ(-1, daemon_->wait_exit()) << "by the signal";
 }
 
+/* What it writes to may take nothing, for as long as it likes. */
+TEST_F(Daemon, WaitsForNoReaderOfItsWords)
+{
+    run_command("mkfifo /tmp/words /tmp/log; mkdir /tmp/full; mount -t tmpfs -o size=64k full /tmp/full");
+    const unique_fd words{open("/tmp/words", O_RDWR | O_CLOEXEC)};
+    const unique_fd lines{open("/tmp/log", O_RDWR | O_CLOEXEC | O_NONBLOCK)};
+    const unique_fd system_log{socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0)};
+    install_program("syslogd", "exit 0"); /* which would listen there */
+    const sockaddr_un at{AF_UNIX, "/dev/log"};
+    ASSERT_EQ(0, bind(system_log.get(), reinterpret_cast<const sockaddr *>(&at), sizeof at));
+    const auto taken_from = [](int fd) {
+        std::string all(1 << 20, '\0');
+        std::size_t len = 0;
+        for (ssize_t n; (n = read(fd, all.data() + len, all.size() - len)) > 0;)
+            len += static_cast<std::size_t>(n);
+        return all.substr(0, len);
+    };
+    const auto taken = [&](const std::string &log) {
+        return log == "/tmp/full/log" ? read_file(log) : taken_from(log.empty() ? system_log.get() : lines.get());
+    };
+    for (const std::string log : {"/tmp/log", "/tmp/full/log", ""}) {
+        install_program("vex_log_manage", "VEX_LOG_FILE=" + log + " exec /usr/vex/bin/vex_log_manage >/tmp/words");
+        const daemon_process daemon;
+        const tool_connection tool;
+        for (int i = 0; i < 3000; ++i)
+            ASSERT_EQ(kOnline, tool.ask(kAskMode)) << log << i;
+        const std::string first = taken(log);
+        EXPECT_NE(std::string::npos, first.find("start vex_log_manage...")) << log;
+        run_command(": >/tmp/full/log");
+        EXPECT_EQ(kOnline, tool.ask(kAskMode));
+        const std::string then = taken(log);
+        EXPECT_NE(std::string::npos, then.find(" lines before this one were lost")) << log;
+    }
+}
+
 TEST_F(Daemon, KeepsNothingOfThreeHundredTools)
 {
     start();

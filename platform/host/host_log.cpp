@@ -1,4 +1,5 @@
-/* The maker's log on any Linux machine: a file named by VEX_LOG_FILE, else syslog(3). */
+/* The maker's log on any Linux machine: a file named by VEX_LOG_FILE, else the system's log. */
+#include "platform/host/log_sink.h"
 #include "platform/vex_platform.h"
 
 #include <cerrno>
@@ -6,9 +7,6 @@
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
-#include <fcntl.h>
-#include <syslog.h>
-#include <unistd.h>
 
 namespace
 {
@@ -19,21 +17,11 @@ constexpr std::size_t kOriginMax = 64;                                      /* s
 constexpr std::size_t kLineMax = kStampMax + kOriginMax + 4 * kTextMax + 1; /* every byte as \xNN, newline */
 constexpr int kDefaultLevel = 6;
 
-struct log_sink {
-    int max_level; /* lines above it are dropped */
-    int fd;        /* the log file, or -1: syslog(3) */
-};
-
-log_sink open_sink()
+int max_level()
 {
-    const char *level = std::getenv("VEX_LOG_LEVEL");
-    const char *path = std::getenv("VEX_LOG_FILE");
-    log_sink sink{level != nullptr ? static_cast<int>(std::strtol(level, nullptr, 10)) : kDefaultLevel, -1};
-    if (path != nullptr && *path != '\0')
-        sink.fd = open(path, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
-    if (sink.fd == -1)
-        openlog("vex_log_manage", LOG_NDELAY, LOG_DAEMON);
-    return sink;
+    static const char *const level = std::getenv("VEX_LOG_LEVEL"); /* lines above it are dropped */
+    static const int max = level != nullptr ? static_cast<int>(std::strtol(level, nullptr, 10)) : kDefaultLevel;
+    return max;
 }
 
 /* Copies `text` to `out` so that a line stays a line, whatever it holds; returns the number of bytes written. */
@@ -75,13 +63,6 @@ std::size_t bounded(int printed, std::size_t size)
     return static_cast<std::size_t>(printed) < size ? static_cast<std::size_t>(printed) : size - 1;
 }
 
-/* The sink, opened by the first line. */
-const log_sink &sink()
-{
-    static const log_sink opened = open_sink();
-    return opened;
-}
-
 /* Formats and writes one line. On its own, so that a line above the level costs no stack. */
 [[gnu::noinline]] void append(int level, const char *source, int line, const char *format, va_list args)
 {
@@ -91,17 +72,11 @@ const log_sink &sink()
         --text_len;
 
     char out[kLineMax];
-    std::size_t used = sink().fd != -1 ? stamp(out, sizeof out, level) : 0;
+    std::size_t used = log_sink_is_file() ? stamp(out, sizeof out, level) : 0;
     used += bounded(std::snprintf(out + used, kOriginMax, "%s:%d ", source, line), kOriginMax);
     used += escape(text, text_len, out + used);
-    if (sink().fd == -1) {
-        syslog(level == 0 ? LOG_ERR : LOG_INFO, "%.*s", static_cast<int>(used), out);
-        return;
-    }
     out[used++] = '\n';
-    /* One write a line, so that lines of several threads and processes never mix. A log that can't be written
-     * has nobody to tell. */
-    [[maybe_unused]] const ssize_t written = write(sink().fd, out, used);
+    log_sink_write(level, {out, used});
 }
 
 } // namespace
@@ -109,7 +84,7 @@ const log_sink &sink()
 void vex_syslog_append(int level, const char *source, int line, int /*module*/, const char *format, ...)
 {
     const int saved_errno = errno; /* the first line opens the sink */
-    if (level <= sink().max_level) {
+    if (level <= max_level()) {
         va_list args;
         va_start(args, format);
         append(level, source, line, format, args);
