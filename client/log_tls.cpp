@@ -28,6 +28,13 @@ void log_name(const char *what, const X509_NAME *name)
     g_tls.CRYPTO_free(line, "log_tls.cpp", __LINE__);
 }
 
+/* The server's certificate was refused in the handshake: why. */
+void log_refusal(long verified)
+{
+    LOG_FAULT("%s: the server's certificate is refused: %s\n", "vex_open_ssl",
+              g_tls.X509_verify_cert_error_string(verified));
+}
+
 /* Loads the device's certificates; false, after the log line of what is wrong. */
 bool load_files(SSL_CTX *context)
 {
@@ -67,9 +74,12 @@ std::unique_ptr<log_tls_session> shake_hands(int fd, int stop_fd)
     if (session && session->connect(log_clock::now() + kHandshakeMax))
         return session;
     const int error = errno;
+    const long verified = session ? g_tls.SSL_get_verify_result(session->handle()) : X509_V_OK;
     if (session)
         session->close(log_clock::now());
     LOG_FAULT("%s: SSL connect error %s errno: %d\n", "vex_open_ssl", std::strerror(error), error);
+    if (verified != X509_V_OK)
+        log_refusal(verified);
     return nullptr;
 }
 

@@ -20,7 +20,8 @@ log_tls_result log_tls_start();
 
 /* Opens a session on a connected socket, which it makes non-blocking, and checks the server: within 30 seconds, and
  * before `stop_fd` is readable (see log_tls_session::open), or it has failed. 1, and the session in `*session`, or TLS
- * is off; 0 failed (logged), and null in `*session`. For any thread. */
+ * is off; 0 failed (logged, with the reason when it is the server's certificate), and null in `*session`. For any
+ * thread. */
 int vex_open_ssl(int fd, std::unique_ptr<log_tls_session> *session, int stop_fd);
 
 /* 1 when the server's certificate is accepted, and says whose it is; 0 when not (logged). */

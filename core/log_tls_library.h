@@ -17,8 +17,8 @@
     X(SSL_new) X(SSL_set_rfd) X(SSL_set0_wbio) X(SSL_connect) X(SSL_read) X(SSL_write) X(SSL_get_error)                \
     X(SSL_shutdown) X(SSL_free) X(SSL_get_current_cipher) X(SSL_CIPHER_get_name) X(SSL_get_verify_result)              \
     X(SSL_get_peer_certificate) X(X509_get_subject_name) X(X509_get_issuer_name) X(X509_NAME_get_text_by_NID)          \
-    X(X509_NAME_oneline) X(X509_free) X(CRYPTO_free) X(ERR_clear_error) X(ERR_print_errors_fp) X(BIO_s_mem)            \
-    X(BIO_new) X(BIO_free) X(BIO_ctrl) X(BIO_read)
+    X(X509_NAME_oneline) X(X509_verify_cert_error_string) X(X509_free) X(CRYPTO_free) X(ERR_clear_error)               \
+    X(ERR_print_errors_fp) X(BIO_s_mem) X(BIO_new) X(BIO_free) X(BIO_ctrl) X(BIO_read)
 /* clang-format on */
 
 /* The library's calls under their own names. */

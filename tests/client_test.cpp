@@ -70,15 +70,17 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
     const std::string sign =
         "cd /tmp/c; rm -f db*; touch db; echo 01 >serial; openssl ca -batch -config ca.cnf -cert ca.crt "
         "-keyfile ca.key -in server.csr -out bad.crt -notext ";
-    for (const auto &[make, options, accepted] :
-         {std::tuple{sign + "-days 30", "-tls1_2", true}, /* it asks for none of ours, too */
-          {sign + "-days 30", "-tls1_3", true},
-          {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", false},
-          {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", false},
-          {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "", false},
+    for (const auto &[make, options, reason] :
+         {std::tuple{sign + "-days 30", "-tls1_2", ""}, /* it asks for none of ours, too */
+          {sign + "-days 30", "-tls1_3", ""},
+          {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", "certificate has expired"},
+          {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", "certificate is not yet valid"},
+          {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "",
+           "signed certificate"},
           {device_program("certificates") + " /tmp/o; cp /tmp/c/ca.crt " + kCertDir +
                "logca_cert.crt; cp /tmp/o/server.crt /tmp/c/bad.crt; cp /tmp/o/server.key /tmp/c",
-           "", false}}) {
+           "", "certificate signature failure"}}) {
+        const bool accepted = *reason == '\0';
         run_command(make + "; rm -f /tmp/daemon.log");
         start_server(
             "until grep -q ControlLink /tmp/said || grep -q 'connect error' /tmp/daemon.log; do sleep 0.01; done | "
@@ -90,6 +92,8 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
         server_status();
         EXPECT_EQ(accepted, server_said().find("ControlLink") != std::string::npos) << make << server_said();
         EXPECT_EQ(accepted ? 0 : 1, daemon.logged("vex_open_ssl: SSL connect error ")) << make;
+        EXPECT_EQ(accepted ? 0 : 1, daemon.logged("vex_open_ssl: the server's certificate is refused: ")) << make;
+        EXPECT_TRUE(accepted || daemon.logged(reason) == 1) << daemon.log();
         EXPECT_EQ(accepted ? 0 : 1, daemon.logged("fail connect to address: 127.0.0.1, port number: 5000"));
         EXPECT_EQ(1, daemon.logged("Trying to connect")) << "a session is not tried again";
     }
@@ -160,6 +164,7 @@ TEST_F(Client, EndsWithItsServerWheneverThatIs)
         daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
         EXPECT_EQ(0, daemon.wait_exit()) << server;
         EXPECT_NE(0, daemon.logged(words)) << server << daemon.log();
+        EXPECT_EQ(0, daemon.logged("certificate is refused")) << server;
         EXPECT_EQ(1, daemon.logged("vex_log_manage exit ")) << server;
         server_status();
     }
