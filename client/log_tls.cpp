@@ -3,6 +3,7 @@
 #include "core/daemon_state.h"
 #include "core/log_line.h"
 #include "core/log_tls_library.h"
+#include "core/log_tools.h"
 
 #include <cerrno>
 #include <chrono>
@@ -18,6 +19,8 @@ constexpr char kCaFile[] = "/usr/vex/vex_conf/logcert/logca_cert.crt";
 constexpr char kCertFile[] = "/usr/vex/vex_conf/logcert/logclient_cert.crt";
 constexpr char kKeyFile[] = "/usr/vex/vex_conf/logcert/logkey.pem";
 
+constexpr char kCiphers[] = "ECDHE+AESGCM:ECDHE+CHACHA20:AESGCM:CHACHA20:AESCCM:!aNULL:!PSK:!SRP"; /* AEAD, all */
+
 constexpr auto kHandshakeMax = std::chrono::seconds(30);
 
 /* Logs a name of the certificate as one line. */
@@ -28,11 +31,46 @@ void log_name(const char *what, const X509_NAME *name)
     g_tls.CRYPTO_free(line, "log_tls.cpp", __LINE__);
 }
 
+/* The name or address that the server's certificate must be for; empty: any. */
+struct server_name {
+    char text[256] = {}; /* names have up to 253 characters */
+};
+
+server_name read_server_name()
+{
+    server_name name;
+    vex_get_nv_item("log_server_name", name.text, sizeof name.text);
+    return name;
+}
+
 /* The server's certificate was refused in the handshake: why. */
 void log_refusal(long verified)
 {
     LOG_FAULT("%s: the server's certificate is refused: %s\n", "vex_open_ssl",
               g_tls.X509_verify_cert_error_string(verified));
+    if (verified == X509_V_ERR_HOSTNAME_MISMATCH || verified == X509_V_ERR_IP_ADDRESS_MISMATCH)
+        LOG_FAULT("%s: log_server_name demands a certificate for '%s'\n", "vex_open_ssl", read_server_name().text);
+}
+
+/* What no session does without, whatever the library's own configuration says; false, after the log line of what cannot
+ * be had. */
+bool set_demands(SSL_CTX *context)
+{
+    g_tls.SSL_CTX_set_verify(context, SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
+    /* A TLS 1.2 server may not renegotiate: a write of one thread would have to take part in what another reads. */
+    g_tls.SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION);
+    if (g_tls.SSL_CTX_ctrl(context, SSL_CTRL_SET_MIN_PROTO_VERSION, TLS1_2_VERSION, nullptr) != 1 ||
+        g_tls.SSL_CTX_set_cipher_list(context, kCiphers) != 1) {
+        LOG_FAULT("the TLS library has no TLS 1.2 with %s\n", kCiphers);
+        return false;
+    }
+    const server_name name = read_server_name();
+    X509_VERIFY_PARAM *const param = g_tls.SSL_CTX_get0_param(context);
+    if (*name.text == '\0' || g_tls.X509_VERIFY_PARAM_set1_ip_asc(param, name.text) == 1 ||
+        g_tls.X509_VERIFY_PARAM_set1_host(param, name.text, 0) == 1)
+        return true;
+    LOG_FAULT("log_server_name cannot be demanded of a certificate: '%s'\n", name.text);
+    return false;
 }
 
 /* Loads the device's certificates; false, after the log line of what is wrong. */
@@ -102,9 +140,10 @@ log_tls_result log_tls_start()
         g_tls.ERR_print_errors_fp(stderr);
         return log_tls_result::no_context;
     }
-    g_tls.SSL_CTX_set_verify(context, SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
-    /* A TLS 1.2 server may not renegotiate: a write of one thread would have to take part in what another reads. */
-    g_tls.SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION);
+    if (!set_demands(context)) {
+        g_tls.SSL_CTX_free(context);
+        return log_tls_result::no_context;
+    }
     if (!load_files(context)) {
         g_tls.SSL_CTX_free(context);
         return log_tls_result::bad_files;

@@ -73,7 +73,12 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
     for (const auto &[make, options, reason] :
          {std::tuple{sign + "-days 30", "-tls1_2", ""}, /* it asks for none of ours, too */
           {sign + "-days 30", "-tls1_3", ""},
-          {sign + "-startdate 20200101000000Z -enddate 20210101000000Z", "-tls1_3", "certificate has expired"},
+          {"echo 'log_server_name=log server' >>/etc/vex/nvconfig", "-tls1_3", ""},
+          {"sed -i 's/=log server/=log.example.net/' /etc/vex/nvconfig", "-tls1_2", "ostname mismatch"},
+          {"sed -i 's/=log.example.net/=10.0.0.1/' /etc/vex/nvconfig", "-tls1_3", "IP address mismatch"},
+          {"sed -i /log_server_name/d /etc/vex/nvconfig; " + sign +
+               "-startdate 20200101000000Z -enddate 20210101000000Z",
+           "-tls1_3", "certificate has expired"},
           {sign + "-startdate 20990101000000Z -enddate 20991231000000Z", "-tls1_2", "certificate is not yet valid"},
           {"cd /tmp/c; openssl x509 -req -in server.csr -signkey server.key -out bad.crt -days 30", "",
            "signed certificate"},
@@ -97,6 +102,18 @@ TEST_F(Client, TrustsNoServerWithoutItsCertificate)
         EXPECT_EQ(accepted ? 0 : 1, daemon.logged("fail connect to address: 127.0.0.1, port number: 5000"));
         EXPECT_EQ(1, daemon.logged("Trying to connect")) << "a session is not tried again";
     }
+}
+
+TEST_F(Client, SpeaksNoOldTls)
+{
+    start_server(
+        "until grep -q 'connect error' /tmp/daemon.log; do sleep 0.01; done | openssl s_server -quiet -naccept 1 "
+        "-accept 5000 -cert /tmp/c/server.crt -key /tmp/c/server.key -tls1_2 "
+        "-cipher ECDHE-ECDSA-AES128-SHA256 2>/dev/null");
+    daemon_process daemon({"-a", "127.0.0.1", "-p", "5000"});
+    EXPECT_EQ(0, daemon.wait_exit());
+    EXPECT_EQ(1, daemon.logged("vex_open_ssl: SSL connect error "));
+    server_status();
 }
 
 TEST_F(Client, SaysWhichOfItsOwnFilesIsNoGood)
