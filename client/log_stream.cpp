@@ -645,6 +645,20 @@ void log_stream_own_program(log_kind kind, bool owns)
     }
 }
 
+void log_streams_look_after()
+{
+    for (const log_kind kind : {log_kind::syslog, log_kind::qxdm}) {
+        std::shared_ptr<log_link> link;
+        {
+            const log_lock hold{g_registry_lock};
+            if (const shared_stream stream = used_stream(kind))
+                link = stream->link;
+        }
+        if (link)
+            log_link_look_after(*link);
+    }
+}
+
 void log_streams_end_all()
 {
     static log_kind kinds[] = {log_kind::syslog, log_kind::qxdm};

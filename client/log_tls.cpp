@@ -19,7 +19,7 @@ constexpr char kCaFile[] = "/usr/vex/vex_conf/logcert/logca_cert.crt";
 constexpr char kCertFile[] = "/usr/vex/vex_conf/logcert/logclient_cert.crt";
 constexpr char kKeyFile[] = "/usr/vex/vex_conf/logcert/logkey.pem";
 
-constexpr char kCiphers[] = "ECDHE+AESGCM:ECDHE+CHACHA20:AESGCM:CHACHA20:AESCCM:!aNULL:!PSK:!SRP"; /* AEAD, all */
+constexpr char kCiphers[] = "ECDHE+AESGCM:ECDHE+CHACHA20:AESGCM:CHACHA20:!aNULL:!PSK:!SRP"; /* AEAD, all */
 
 constexpr auto kHandshakeMax = std::chrono::seconds(30);
 
@@ -66,8 +66,10 @@ bool set_demands(SSL_CTX *context)
     }
     const server_name name = read_server_name();
     X509_VERIFY_PARAM *const param = g_tls.SSL_CTX_get0_param(context);
-    if (*name.text == '\0' || g_tls.X509_VERIFY_PARAM_set1_ip_asc(param, name.text) == 1 ||
-        g_tls.X509_VERIFY_PARAM_set1_host(param, name.text, 0) == 1)
+    const bool demanded = *name.text == '\0' || g_tls.X509_VERIFY_PARAM_set1_ip_asc(param, name.text) == 1 ||
+                          g_tls.X509_VERIFY_PARAM_set1_host(param, name.text, 0) == 1;
+    g_tls.ERR_clear_error(); /* a name is no IP address */
+    if (demanded)
         return true;
     LOG_FAULT("log_server_name cannot be demanded of a certificate: '%s'\n", name.text);
     return false;

@@ -3,7 +3,10 @@
 #include "core/daemon_state.h"
 #include "core/log_line.h"
 
+#include <algorithm>
 #include <cstring>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <poll.h>
 #include <sys/socket.h>
 
@@ -13,6 +16,7 @@ namespace
 constexpr char kLogSource[] = "vex_log_manage";
 
 constexpr auto kGraceMax = std::chrono::seconds(10); /* for what runs for a peer that is gone */
+constexpr auto kUnansweredMax = std::chrono::seconds(100);
 
 } // namespace
 
@@ -54,4 +58,28 @@ bool log_link::is_given_up()
                  static_cast<int>(kGraceMax.count()));
     }
     return log_clock::now() >= lost_since_ + kGraceMax;
+}
+
+bool log_link::has_vanished()
+{
+    tcp_info info{};
+    socklen_t len = sizeof info;
+    if (getsockopt(fd.get(), IPPROTO_TCP, TCP_INFO, &info, &len) != 0 ||
+        (info.tcpi_unacked == 0 && info.tcpi_probes == 0)) {
+        unanswered_since_ = log_clock::time_point::max();
+        return false;
+    }
+    const auto now = log_clock::now();
+    const auto answered = now - std::chrono::milliseconds(info.tcpi_last_ack_recv);
+    unanswered_since_ = std::max(std::min(unanswered_since_, now), answered);
+    return now >= unanswered_since_ + kUnansweredMax;
+}
+
+void log_link_look_after(log_link &link)
+{
+    if (link.taken || !link.has_vanished())
+        return;
+    LOG_NOTE("the peer of fd[%d] has answered nothing for %d seconds, its connection ends\n", link.fd.get(),
+             static_cast<int>(kUnansweredMax.count()));
+    shutdown(link.fd.get(), SHUT_RDWR);
 }

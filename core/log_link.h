@@ -44,11 +44,20 @@ struct log_link {
      * hung up: what still runs for it is ended, and nothing more is run. For its owner. */
     bool is_given_up();
 
+    /* Whether the peer has left bytes unanswered for 100 seconds. One that only does not read is not meant: it answers, by
+     * saying so. Asked every few seconds, by one thread. */
+    bool has_vanished();
+
 private:
     bool is_lost() const;
 
     log_clock::time_point lost_since_ = log_clock::time_point::max();
+    log_clock::time_point unanswered_since_ = log_clock::time_point::max();
 };
+
+/* Ends the connection of a peer that has vanished (logged): its reader and whoever sends on it learn of it at once. Called
+ * every few seconds, by one thread. Keepalive finds only those that owe no answer. */
+void log_link_look_after(log_link &link);
 
 /* A shared object; null without memory. */
 template <typename Type, typename... Arguments> std::shared_ptr<Type> log_make_shared(Arguments &&...arguments)

@@ -8,6 +8,7 @@
 #include "core/log_options.h"
 #include "core/log_process.h"
 #include "core/log_programs.h"
+#include "core/log_registry.h"
 #include "core/log_stdout.h"
 #include "core/log_tools.h"
 #include "handlers/bsp_module_level.h"
@@ -115,8 +116,12 @@ int main(int argc, char **argv)
     else if (const int status = run_client_mode(); status != 0)
         return status;
     std::optional<int> status;
-    while (!(status = exit_status()))
+    while (!(status = exit_status())) {
         log_reap_programs();
+        if (const std::shared_ptr<log_link> link = log_cmd_link())
+            log_link_look_after(*link);
+        log_streams_look_after();
+    }
     log_streams_end_all();
     log_print_flush();
     _exit(*status); /* other threads still run: nothing that they use may be torn down */

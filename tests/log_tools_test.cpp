@@ -1,5 +1,6 @@
 #include "core/daemon_state.h"
 #include "core/log_options.h"
+#include "core/log_stdout.h"
 #include "core/log_tools.h"
 #include "tests/memory_platform.h"
 
@@ -70,6 +71,7 @@ TEST_F(Tools, PacketsAreSentWholeOrRefused)
     g_daemon.use_ssl = 1; /* without a session */
     EXPECT_EQ(-1, log_send_packet(ends[0], nullptr, "x", 1));
     g_daemon.use_ssl = 0;
+    log_print_flush();
     EXPECT_EQ("log_send_packet complete, the write data size is 4\n"
               "log_send_packet data fail  errno= 32 (Broken pipe)\n",
               testing::internal::GetCapturedStdout());
