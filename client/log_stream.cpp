@@ -654,8 +654,14 @@ void log_streams_look_after()
             if (const shared_stream stream = used_stream(kind))
                 link = stream->link;
         }
-        if (link)
-            log_link_look_after(*link);
+        if (!link)
+            continue;
+        log_link_look_after(*link);
+        if (link->taken || !link->has_stalled())
+            continue;
+        LOG_NOTE("%s: the server of fd[%d] takes nothing any more, the stream ends\n", names_of(kind).link_body,
+                 link->fd.get());
+        shutdown(link->fd.get(), SHUT_RDWR);
     }
 }
 

@@ -31,7 +31,8 @@ void log_stream_end(log_kind kind);
  * is again from the next confirmation on. */
 void log_stream_own_program(log_kind kind, bool owns);
 
-/* Ends the data links whose server has vanished. Called every few seconds, by one thread. */
+/* Ends the data links whose server has vanished, or has taken nothing for 60 seconds (logged): whatever logs on the device
+ * would wait for it. Called every few seconds, by one thread. */
 void log_streams_look_after();
 
 /* Ends both streams, as the process is about to, and waits for that: 3.5 seconds for all of it, then 2.5 for the links

@@ -59,6 +59,9 @@ bool set_demands(SSL_CTX *context)
     g_tls.SSL_CTX_set_verify(context, SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
     /* A TLS 1.2 server may not renegotiate: a write of one thread would have to take part in what another reads. */
     g_tls.SSL_CTX_set_options(context, SSL_OP_NO_RENEGOTIATION);
+    /* A read comes back after each record: else it would answer requests for new keys, without bound, for as long as they
+     * come. */
+    g_tls.SSL_CTX_ctrl(context, SSL_CTRL_CLEAR_MODE, SSL_MODE_AUTO_RETRY, nullptr);
     if (g_tls.SSL_CTX_ctrl(context, SSL_CTRL_SET_MIN_PROTO_VERSION, TLS1_2_VERSION, nullptr) != 1 ||
         g_tls.SSL_CTX_set_cipher_list(context, kCiphers) != 1) {
         LOG_FAULT("the TLS library has no TLS 1.2 with %s\n", kCiphers);

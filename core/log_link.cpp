@@ -5,9 +5,11 @@
 
 #include <algorithm>
 #include <cstring>
+#include <linux/sockios.h>
+#include <linux/tcp.h> /* knows more than netinet/tcp.h */
 #include <netinet/in.h>
-#include <netinet/tcp.h>
 #include <poll.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 
 namespace
@@ -17,6 +19,15 @@ constexpr char kLogSource[] = "vex_log_manage";
 
 constexpr auto kGraceMax = std::chrono::seconds(10); /* for what runs for a peer that is gone */
 constexpr auto kUnansweredMax = std::chrono::seconds(100);
+constexpr auto kStalledMax = std::chrono::seconds(60);
+
+/* What the kernel knows of a connection; false when that is less than is asked for here. */
+bool read_tcp_info(int fd, tcp_info &info)
+{
+    socklen_t len = sizeof info;
+    return getsockopt(fd, IPPROTO_TCP, TCP_INFO, &info, &len) == 0 &&
+           len >= offsetof(tcp_info, tcpi_bytes_acked) + sizeof info.tcpi_bytes_acked;
+}
 
 } // namespace
 
@@ -63,9 +74,7 @@ bool log_link::is_given_up()
 bool log_link::has_vanished()
 {
     tcp_info info{};
-    socklen_t len = sizeof info;
-    if (getsockopt(fd.get(), IPPROTO_TCP, TCP_INFO, &info, &len) != 0 ||
-        (info.tcpi_unacked == 0 && info.tcpi_probes == 0)) {
+    if (!read_tcp_info(fd.get(), info) || (info.tcpi_unacked == 0 && info.tcpi_probes == 0)) {
         unanswered_since_ = log_clock::time_point::max();
         return false;
     }
@@ -73,6 +82,19 @@ bool log_link::has_vanished()
     const auto answered = now - std::chrono::milliseconds(info.tcpi_last_ack_recv);
     unanswered_since_ = std::max(std::min(unanswered_since_, now), answered);
     return now >= unanswered_since_ + kUnansweredMax;
+}
+
+bool log_link::has_stalled()
+{
+    tcp_info info{};
+    int waiting = 0;
+    const auto now = log_clock::now();
+    if (!read_tcp_info(fd.get(), info) || ioctl(fd.get(), SIOCOUTQ, &waiting) != 0)
+        return false;
+    if (waiting == 0 || info.tcpi_bytes_acked != acknowledged_)
+        acknowledged_at_ = now;
+    acknowledged_ = info.tcpi_bytes_acked;
+    return now >= acknowledged_at_ + kStalledMax;
 }
 
 void log_link_look_after(log_link &link)

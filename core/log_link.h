@@ -14,6 +14,7 @@
 #include <atomic>
 #include <cerrno>
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <new>
 #include <sys/types.h>
@@ -48,11 +49,16 @@ struct log_link {
      * saying so. Asked every few seconds, by one thread. */
     bool has_vanished();
 
+    /* Whether the peer has taken nothing of what waits for it for 60 seconds. Asked every few seconds, by one thread. */
+    bool has_stalled();
+
 private:
     bool is_lost() const;
 
     log_clock::time_point lost_since_ = log_clock::time_point::max();
     log_clock::time_point unanswered_since_ = log_clock::time_point::max();
+    std::uint64_t acknowledged_ = 0; /* bytes, at the last look */
+    log_clock::time_point acknowledged_at_ = log_clock::now();
 };
 
 /* Ends the connection of a peer that has vanished (logged): its reader and whoever sends on it learn of it at once. Called

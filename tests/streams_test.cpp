@@ -684,6 +684,21 @@ TEST_F(Streams, AreConfirmedOnce)
     hang_up();
 }
 
+/* A server that asks for new keys and reads none of the answers. */
+TEST_F(Streams, KeepNoMoreAnswersThanTheyHaveRoomFor)
+{
+    call(true, 0);
+    EXPECT_EQ(kOnline, ask(kAskMode));
+    const long memory = daemon_->memory();
+    bool taken = true;
+    for (int i = 0; taken && i < 200000; ++i) /* 4 MB of answers */
+        taken = SSL_key_update(control_->session.get(), SSL_KEY_UPDATE_REQUESTED) == 1 &&
+                SSL_do_handshake(control_->session.get()) == 1;
+    EXPECT_TRUE(!kMemoryIsOurs || daemon_->memory() <= memory + 512) << daemon_->memory() - memory;
+    control_.reset();
+    EXPECT_EQ(0, daemon_->wait_exit());
+}
+
 /* What has arrived is carried out although no reply can be sent. */
 TEST_F(Streams, RunCommandsWhoseRepliesAreLost)
 {
@@ -699,6 +714,28 @@ TEST_F(Streams, RunCommandsWhoseRepliesAreLost)
         EXPECT_EQ(size, tls ? SSL_write(control_->session.get(), commands.data(), size)
                             : send(control_->fd.get(), commands.data(), commands.size(), MSG_NOSIGNAL));
         EXPECT_TRUE(daemon_->logs("modem mode = lpm", count)) << tls;
+        hang_up();
+    }
+}
+
+class SlowStreams : public Streams
+{
+};
+
+/* What logs on the device would wait for such a server. */
+TEST_F(SlowStreams, EndWithAServerThatTakesNothing)
+{
+    for (const bool tls : {false, true}) {
+        call(tls, 100);
+        tool_link link = start(kSyslog);
+        confirm(link, kSyslog);
+        EXPECT_EQ(kOnline, ask(kAskMode));
+        daemon_->commands();
+        for (int i = 0; i < 3 && daemon_->logged("takes nothing any more, the stream ends") == 0; ++i)
+            daemon_->logs("takes nothing any more, the stream ends"); /* which gives up after 30 seconds */
+        EXPECT_TRUE(daemon_->logs("exit log_recv_server_msg")) << daemon_->log();
+        EXPECT_NE(std::string::npos, daemon_->commands().find("vex_syslog.sh")) << "it logs locally again";
+        EXPECT_EQ(kOnline, ask(kAskMode));
         hang_up();
     }
 }
