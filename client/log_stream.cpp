@@ -319,10 +319,11 @@ bool take_piece(log_link &link, log_reassembly &state, std::span<const unsigned 
 {
     constexpr char kName[] = "log_recv_server_msg";
     if (link.taken) {
-        LOG_NOTE("%s: the stream was stopped or started anew, what fd[%d] brought is dropped\n", kName, link.fd.get());
+        LOG_NOTE("%s: the stream was stopped or started again, what fd[%d] brought is dropped\n", kName, link.fd.get());
         return true;
     }
-    LOG_NOTE("%s:recvbuf=%.*s\n", kName, static_cast<int>(piece.size()), reinterpret_cast<const char *>(piece.data()));
+    if (!state.is_silent())
+        LOG_NOTE("%s:recvbuf=%.*s\n", kName, static_cast<int>(piece.size()), reinterpret_cast<const char *>(piece.data()));
     log_proc_tcp_pkg(state, piece);
     return true;
 }

@@ -25,6 +25,30 @@ void append(log_reassembly &state, std::span<const unsigned char> piece)
     state.recv_pkg_len += piece.size();
 }
 
+/* Whether the held bytes begin with a frame that can be handled; says nothing in the log. */
+bool frame_is_whole(const log_reassembly &state)
+{
+    const unsigned char *held = state.incoming->recv_pkg_buf;
+    const log_pkg_header header = log_pkg_read_header(held, state.recv_pkg_len);
+    return header.has_data_len && state.recv_pkg_len >= header.frame_len() &&
+           std::memcmp(held, PKG_HEAD, kPkgTagLen) == 0 &&
+           std::memcmp(held + header.frame_len() - kPkgTagLen, PKG_TAIL, kPkgTagLen) == 0;
+}
+
+/* Counts small pieces that complete no frame. False for one that has to be passed over in silence. */
+bool is_worth_telling(log_reassembly &state, std::size_t piece_len)
+{
+    if (piece_len >= kLogSmallPiece || frame_is_whole(state)) {
+        if (state.is_silent())
+            LOG_NOTE("%s: [%u] small pieces were not logged\n", kName, state.small_pieces - kLogSmallPiecesTold);
+        state.small_pieces = 0;
+        return true;
+    }
+    if (++state.small_pieces == kLogSmallPiecesTold + 1)
+        LOG_NOTE("%s: small pieces are not logged until a frame is whole\n", kName);
+    return !state.is_silent();
+}
+
 /* Length of the frame at the start of the held bytes, once it is known and held whole. */
 std::optional<std::size_t> whole_frame(const log_reassembly &state, std::size_t piece_len)
 {
@@ -75,7 +99,8 @@ void drop_frame(log_reassembly &state, std::size_t len)
 
 int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece)
 {
-    LOG_NOTE("enter %s len = [%d]\n", __func__, static_cast<int>(piece.size()));
+    if (!state.is_silent())
+        LOG_NOTE("enter %s len = [%d]\n", __func__, static_cast<int>(piece.size()));
     if (!state.incoming)
         state.incoming = log_allocate<log_incoming>();
     if (!state.incoming) {
@@ -83,6 +108,8 @@ int log_proc_tcp_pkg(log_reassembly &state, std::span<const unsigned char> piece
         return -1;
     }
     append(state, piece);
+    if (!is_worth_telling(state, piece.size()))
+        return 0;
     while (state.recv_pkg_len > 0) {
         const unsigned char *held = state.incoming->recv_pkg_buf;
         const unsigned char *end = held + state.recv_pkg_len;

@@ -18,9 +18,11 @@ bool take_piece(log_link &link, log_reassembly &state, std::span<const unsigned 
         LOG_NOTE("%s: fd=[%d] sends an HTTP request, closed\n", kName, link.fd.get());
         return false;
     }
-    LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(piece.size()));
+    if (!state.is_silent())
+        LOG_NOTE("%s:===========recv data len =%d===================\n", kName, static_cast<int>(piece.size()));
     log_proc_tcp_pkg(state, piece);
-    LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
+    if (!state.is_silent())
+        LOG_NOTE("%s:===========waiting recv data ==================\n", kName);
     return true;
 }
 

@@ -16,8 +16,8 @@ int log_recv_link(log_link &link, log_take_piece take);
 
 /*
  * Owns the command connection: reads it and has its commands carried out until the peer closes, a read fails, or
- * another connection takes it over, or, in server mode, its first bytes are a web browser's request; then takes it out of the registry and has `close` end it, which is given no owner
- * any more. Logs at level 6 as "vex_log_manage".
+ * another connection takes it over, or, in server mode, its first bytes are a web browser's request; then takes it out
+ * of the registry and has `close` end it, which is given no owner any more. Logs at level 6 as "vex_log_manage".
  */
 void log_recv_tcp_msg(log_link &link, void (*close)(log_link &link));
 

@@ -61,6 +61,32 @@ TEST_F(Reassembly, StartsAfreshWithThePieceThatWouldFillTheBuffer)
     EXPECT_NE("", feed(frame(R"({"msgid":"1"})", std::string(61439 - kThree.size(), 'd'))));
 }
 
+TEST_F(Reassembly, TellsOfSmallPiecesInARowOnlyTheFirst)
+{
+    const auto byte_by_byte = [this](const std::string &stream) {
+        std::string commands;
+        for (const char byte : stream)
+            commands += feed({byte});
+        return commands;
+    };
+    for (const std::string &stuck :
+         {std::string("?"), "#~" + big_endian(0x7fffffff), kThree.substr(0, kThree.size() - 1) + "!"}) {
+        state_ = {};
+        byte_by_byte(stuck + std::string(20, 'x'));
+        g_platform = {};
+        byte_by_byte(std::string(30000, 'x'));
+        EXPECT_EQ("", g_platform.log);
+    }
+    state_ = {};
+    EXPECT_EQ(R"(3:{"msgid":"3"}:;)", byte_by_byte(kThree));
+    EXPECT_TRUE(g_platform.logged("6 vex_log_manage log_proc_tcp_pkg: [8] small pieces were not logged$|"));
+    EXPECT_TRUE(g_platform.logged("enter log_proc_tcp_pkg len = [1]$|")) << "each frame is told from its start";
+    g_platform = {};
+    EXPECT_EQ("", byte_by_byte(kFour.substr(0, 15)));
+    EXPECT_EQ(R"(4:{"msgid":"4"}:;)", feed(kFour.substr(15)));
+    EXPECT_FALSE(g_platform.logged("small pieces"));
+}
+
 TEST(RequestLine, IsKnownHoweverItArrives)
 {
     const auto is_request = [](const std::string &opening, std::size_t cut) {
