@@ -3,7 +3,7 @@
 #define SOAK_SERVERS_H
 
 #include "soak/peer.h"
-#include "tools/tool_listener.h"
+#include "device/log_server.h"
 
 #include <optional>
 #include <vector>

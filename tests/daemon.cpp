@@ -44,10 +44,10 @@ std::string mode_reply(const std::string &mode, const std::string &result)
     return R"({"msgid":"11","mode_lpm_online":")" + mode + R"(","Result":")" + result + R"("})";
 }
 
-tool_connection::tool_connection(const char *address)
+tool_connection::tool_connection(const char *address, const char *port)
 {
     addrinfo *to = nullptr;
-    EXPECT_EQ(0, getaddrinfo(address, "48888", nullptr, &to));
+    EXPECT_EQ(0, getaddrinfo(address, port, nullptr, &to));
     fd.reset(socket(to->ai_family, SOCK_STREAM | SOCK_CLOEXEC, 0));
     const timeval patience{kPatience / 1000, 0};
     setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
@@ -84,12 +84,42 @@ std::string tool_connection::ask(const std::string &control, const std::string &
     return receive();
 }
 
-daemon_process::daemon_process(const std::vector<std::string> &arguments, bool streams)
-    : log_changes_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK))
+written_log::written_log(std::string path) : path_(std::move(path)), changes_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK))
+{
+    std::ofstream{path_};
+    inotify_add_watch(changes_.get(), path_.c_str(), IN_MODIFY);
+}
+
+std::string written_log::text() const
+{
+    return read_file(path_);
+}
+
+long written_log::count(const std::string &words) const
+{
+    long count = 0;
+    const std::string all = text();
+    for (std::size_t at = 0; (at = all.find(words, at)) != std::string::npos; ++at)
+        ++count;
+    return count;
+}
+
+bool written_log::awaits(const std::string &words, long wanted) const
+{
+    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
+    while (count(words) < wanted) {
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - std::chrono::steady_clock::now());
+        char events[4096];
+        if (!readable(changes_.get(), static_cast<int>(left.count())))
+            return false;
+        EXPECT_LT(0, read(changes_.get(), events, sizeof events));
+    }
+    return true;
+}
+
+daemon_process::daemon_process(const std::vector<std::string> &arguments, bool streams) : log_(kLogFile)
 {
     std::filesystem::create_directories("/run/vex/msg");
-    std::ofstream{kLogFile};
-    inotify_add_watch(log_changes_.get(), kLogFile, IN_MODIFY);
     std::vector<char *> argv{const_cast<char *>("vex_log_manage")};
     for (const std::string &argument : arguments)
         argv.push_back(const_cast<char *>(argument.c_str()));
@@ -131,20 +161,6 @@ int daemon_process::wait_exit()
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-std::string daemon_process::log() const
-{
-    return read_file(kLogFile);
-}
-
-long daemon_process::logged(const std::string &text) const
-{
-    long count = 0;
-    const std::string all = log();
-    for (std::size_t at = 0; (at = all.find(text, at)) != std::string::npos; ++at)
-        ++count;
-    return count;
-}
-
 std::string daemon_process::commands()
 {
     constexpr char kMark[] = " cmdStr[";
@@ -157,19 +173,6 @@ std::string daemon_process::commands()
     }
     commands_seen_ = all.size();
     return found;
-}
-
-bool daemon_process::logs(const std::string &text, long count) const
-{
-    const auto end = std::chrono::steady_clock::now() + std::chrono::milliseconds(kPatience);
-    while (logged(text) < count) {
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - std::chrono::steady_clock::now());
-        char events[4096];
-        if (!readable(log_changes_.get(), static_cast<int>(left.count())))
-            return false;
-        EXPECT_LT(0, read(log_changes_.get(), events, sizeof events));
-    }
-    return true;
 }
 
 bool daemon_process::waits_in(long syscall) const

@@ -27,14 +27,29 @@ constexpr bool kMemoryIsOurs = false;
 inline const bool kMemoryIsOurs = std::getenv("VEX_EMULATED") == nullptr;
 #endif
 
-/* A log tool's connection to 127.0.0.1 or ::1. */
+/* A peer's connection to 127.0.0.1 or ::1: a log tool's to the daemon, a device's to the log server. */
 struct tool_connection {
-    explicit tool_connection(const char *address = "127.0.0.1");
+    explicit tool_connection(const char *address = "127.0.0.1", const char *port = "48888");
     void send(const std::string &bytes) const;
     /* The control text, and the data, of the next frame; "(closed)" when there is none. */
     std::string receive(std::string *data = nullptr) const;
     std::string ask(const std::string &control, const std::string &data = "") const;
     unique_fd fd;
+};
+
+/* What a program writes into a file, which it appends to. */
+class written_log
+{
+public:
+    explicit written_log(std::string path); /* empties it */
+    std::string text() const;
+    /* How many times the words are there, and whether they come to be. */
+    long count(const std::string &words) const;
+    bool awaits(const std::string &words, long count = 1) const;
+
+private:
+    const std::string path_;
+    unique_fd changes_;
 };
 
 /* Descriptors and threads of a daemon. */
@@ -51,12 +66,12 @@ public:
     void wait_listening();
     int wait_exit(); /* its exit status */
     /* All log lines, and how many of them hold the text. */
-    std::string log() const;
-    long logged(const std::string &text) const;
+    std::string log() const { return log_.text(); }
+    long logged(const std::string &text) const { return log_.count(text); }
     /* The shell lines it has run since this was asked last, each with a newline. */
     std::string commands();
     /* Waits until so many do. */
-    bool logs(const std::string &text, long count = 1) const;
+    bool logs(const std::string &text, long count = 1) const { return log_.awaits(text, count); }
     std::string proc(const char *name) const { return "/proc/" + std::to_string(pid) + '/' + name; }
     /* Whether one of its threads waits in that system call. */
     bool waits_in(long syscall) const;
@@ -68,7 +83,7 @@ public:
     pid_t pid = -1;
 
 private:
-    unique_fd log_changes_;
+    written_log log_;
     std::size_t commands_seen_ = 0;
 };
 

@@ -1,7 +1,7 @@
 #include "tests/daemon.h"
 #include "tests/frame.h"
 #include "tools/tool_device.h"
-#include "tools/tool_listener.h"
+#include "device/log_server.h"
 #include "tools/tool_process.h"
 
 #include <atomic>

@@ -64,6 +64,20 @@ std::string tool_printable_lines(const std::string &text)
     return out;
 }
 
+std::string tool_command(const char *msgid, const char *group,
+                         std::initializer_list<std::pair<const char *, std::string>> members)
+{
+    const json_tree root{cJSON_CreateObject()};
+    cJSON_AddStringToObject(root.get(), "msgid", msgid);
+    cJSON *const object = group != nullptr ? cJSON_AddObjectToObject(root.get(), group) : root.get();
+    for (const auto &[name, value] : members)
+        cJSON_AddStringToObject(object, name, value.c_str());
+    char *const printed = cJSON_PrintUnformatted(root.get());
+    std::string text = printed != nullptr ? printed : "";
+    cJSON_free(printed);
+    return text;
+}
+
 std::string tool_msgid(const std::string &control)
 {
     const json_tree root{cJSON_ParseWithLength(control.data(), control.size())};

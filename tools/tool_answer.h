@@ -1,10 +1,12 @@
-/* What a device's reply says. */
+/* What is said to a device, and what its reply says. */
 #ifndef TOOLS_TOOL_ANSWER_H
 #define TOOLS_TOOL_ANSWER_H
 
 #include "protocol/json_tree.h"
 
+#include <initializer_list>
 #include <string>
+#include <utility>
 
 enum class tool_verdict {
     success, /* the device said "Success" */
@@ -25,6 +27,10 @@ std::string tool_printable(const std::string &text);
 
 /* The same for a text of several lines, whose ends are kept. */
 std::string tool_printable_lines(const std::string &text);
+
+/* The control text of a command: `members` inside the object `group`, or beside "msgid" where that is null. */
+std::string tool_command(const char *msgid, const char *group,
+                         std::initializer_list<std::pair<const char *, std::string>> members);
 
 /* The message id of a command or a reply; empty when it has none. */
 std::string tool_msgid(const std::string &control);

@@ -8,6 +8,7 @@
 #include <charconv>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -156,6 +157,17 @@ bool replaceable(const std::string &file, std::string &why)
     return false;
 }
 
+/* Today, as part of a file's name. */
+std::string date()
+{
+    char text[16];
+    const std::time_t now = std::time(nullptr);
+    std::tm local{};
+    localtime_r(&now, &local);
+    std::strftime(text, sizeof text, "%Y%m%d", &local);
+    return text;
+}
+
 /* Gives the device's logs a moment to calm down; false when the user wants to end. */
 bool let_calm_down()
 {
@@ -164,8 +176,9 @@ bool let_calm_down()
 
 } // namespace
 
-int tool_archive(tool_device &device, const std::string &file, int tries)
+int tool_archive(tool_device &device, const std::string &place, int tries)
 {
+    const std::string file = device.one_of_many ? place + '/' + device.imei + '-' + date() + ".tgz" : place;
     fetch_result result;
     std::string contents;
     if (!replaceable(file, result.why) || !tool_reach(device, result.why))

@@ -11,29 +11,34 @@ int tool_fail(int status, const std::string &why)
     return status;
 }
 
+namespace
+{
+
+/* A link to the server, which has given us the device. */
+std::optional<tool_link> reach_through_server(const tool_device &device, std::string &why)
+{
+    tool_frame answer;
+    std::optional<tool_link> link = tool_ask_server(
+        device.server, device.limits,
+        {{"msgid", "device"}, {"imei", device.imei}, {"wait", std::to_string(device.server.wait.count())}}, answer, why);
+    if (!link)
+        return std::nullopt;
+    link->with_device = true;
+    link->where = device.imei;
+    return link;
+}
+
+} // namespace
+
 bool tool_reach(tool_device &device, std::string &why)
 {
-    if (!device.link && device.called_at != nullptr)
-        why = "the device has hung up";
+    if (!device.link && tool_has_server(device))
+        device.link = reach_through_server(device, why);
     else if (!device.link)
         device.link =
             tool_connect(device.host, device.port, device.limits,
                          ". Check the address, and that the device is on and its log daemon runs in server mode", why);
     return device.link.has_value();
-}
-
-std::string tool_command(const char *msgid, const char *group,
-                         std::initializer_list<std::pair<const char *, std::string>> members)
-{
-    const json_tree root{cJSON_CreateObject()};
-    cJSON_AddStringToObject(root.get(), "msgid", msgid);
-    cJSON *const object = group != nullptr ? cJSON_AddObjectToObject(root.get(), group) : root.get();
-    for (const auto &[name, value] : members)
-        cJSON_AddStringToObject(object, name, value.c_str());
-    char *const printed = cJSON_PrintUnformatted(root.get());
-    std::string text = printed != nullptr ? printed : "";
-    cJSON_free(printed);
-    return text;
 }
 
 std::optional<tool_answer> tool_exchange(tool_device &device, const std::string &command,
@@ -62,7 +67,7 @@ std::optional<tool_answer> tool_exchange(tool_device &device, const std::string 
 
 std::string tool_said(const tool_device &device, const tool_answer &answer)
 {
-    return (device.link ? device.link->where : device.host + " port " + device.port) + ' ' + answer.reason;
+    return (device.link ? device.link->where : tool_has_server(device) ? device.imei : device.host + " port " + device.port) + ' ' + answer.reason;
 }
 
 std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status)

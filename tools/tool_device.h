@@ -8,10 +8,7 @@
 
 #include "tools/tool_answer.h"
 #include "tools/tool_link.h"
-#include "tools/tool_listener.h"
-
-#include <initializer_list>
-#include <utility>
+#include "tools/tool_server.h"
 
 /* Exit statuses beside those of the command line parser, which are above 100. */
 constexpr int kDone = 0;
@@ -22,22 +19,25 @@ struct tool_device {
     std::string host = "192.168.0.1";
     std::string port = "48888";
     tool_limits limits;
-    bool json = false;                        /* print replies as they came instead of words */
-    const tool_listener *called_at = nullptr; /* it has called us there, and cannot be reached in another way */
-    std::string imei;                         /* of the one that has called */
-    std::optional<tool_link> link;            /* once it was reached, until it fails */
+    bool json = false;             /* print replies as they came instead of words */
+    tool_server server;            /* that the device has called, if it has */
+    std::string imei;              /* by which that knows it */
+    bool one_of_many = false;      /* the same is asked of others, too */
+    std::optional<tool_link> link; /* once it was reached, until it fails */
 };
 
 /* Says what failed; the status. */
 int tool_fail(int status, const std::string &why);
 
+/* Whether the device is behind a log server. */
+inline bool tool_has_server(const tool_device &device)
+{
+    return !device.server.address.empty();
+}
+
 /* Connects unless there is a connection already. Whatever can be wrong on this side is looked at before: to connect is
  * to take the device from another tool. */
 bool tool_reach(tool_device &device, std::string &why);
-
-/* The control text of a command: `members` inside the object `group`, or beside "msgid" where that is null. */
-std::string tool_command(const char *msgid, const char *group,
-                         std::initializer_list<std::pair<const char *, std::string>> members);
 
 /* Where the device is and what its answer says, as a sentence. */
 std::string tool_said(const tool_device &device, const tool_answer &answer);

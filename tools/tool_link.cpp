@@ -1,5 +1,6 @@
 #include "tools/tool_link.h"
 
+#include "tools/tool_answer.h"
 #include "tools/tool_log.h"
 #include "tools/tool_wait.h"
 
@@ -58,9 +59,8 @@ unique_fd connect_one(const addrinfo &address, tool_clock::time_point end, std::
 std::string ended(const tool_link &link, const std::string &how)
 {
     return "the connection to " + link.where + " ended before the answer was there: " + how +
-           (link.called
-                ? ". A device whose link has ended restarts its log daemon and calls again; why it ended is in "
-                  "the device's own log"
+           (link.server
+                ? ". Why it ended is in the server's own log"
                 : ". The device serves one log tool at a time, so another one may have taken it over; if not, "
                   "try again and look at the device's own log");
 }
@@ -73,8 +73,7 @@ std::string silent(const tool_link &link, std::chrono::milliseconds limit, bool 
         return fact +
                ". Either it is still at work, then try again with a larger --reply-timeout, or it does not know the "
                "command: such a one it leaves unanswered";
-    return fact + (link.held.empty() && link.called ? "" : " in the middle of an answer") +
-           ". Try again, or with a larger --stall-timeout";
+    return fact + " in the middle of an answer. Try again, or with a larger --stall-timeout";
 }
 
 /* Length of the frame that the held bytes begin with, 0 while that cannot be said; nothing when they are none. */
@@ -125,22 +124,32 @@ ssize_t write_link(const tool_link &link, std::span<const unsigned char> bytes, 
     return tool_tls_result(link.session.get(), n, wanted);
 }
 
+/* Takes more bytes and holds them; false when there are none, and `why` when there will be none. */
+bool take_some(tool_link &link, short &wanted, std::string &why)
+{
+    unsigned char piece[65536];
+    const ssize_t n = read_link(link, piece, wanted);
+    if (n > 0)
+        link.held.insert(link.held.end(), piece, piece + n);
+    else if (n == 0 || (errno != EAGAIN && errno != EINTR))
+        why = ended(link, n == 0 ? (link.server ? "the server closed it" : "the device closed it")
+                                 : std::strerror(errno));
+    return n > 0;
+}
+
 /* Waits for more bytes and holds them; false, and why, when none come. */
 bool receive_some(tool_link &link, std::chrono::milliseconds first, std::string &why)
 {
     const bool answer = link.held.empty() && first == link.limits.reply;
     const auto limit = link.held.empty() ? first : link.limits.stall;
     const auto end = tool_clock::now() + limit;
-    unsigned char piece[65536];
     for (;;) {
         short wanted = 0;
-        const ssize_t n = read_link(link, piece, wanted);
-        if (n > 0) {
-            link.held.insert(link.held.end(), piece, piece + n);
+        std::string lost;
+        if (take_some(link, wanted, lost))
             return true;
-        }
-        if (n == 0 || (errno != EAGAIN && errno != EINTR)) {
-            why = ended(link, n == 0 ? "the device closed it" : std::strerror(errno));
+        if (!lost.empty()) {
+            why = lost;
             return false;
         }
         std::string interrupt;
@@ -149,6 +158,29 @@ bool receive_some(tool_link &link, std::chrono::milliseconds first, std::string 
         why = !interrupt.empty() ? interrupt : silent(link, limit, answer);
         return false;
     }
+}
+
+/* The frame that the held bytes begin with, if it is whole. `none`, and why, when there will be none: what came is no
+ * frame, or the server's word that the device is gone. */
+std::optional<tool_frame> held_frame(tool_link &link, bool &none, std::string &why)
+{
+    const std::optional<std::size_t> len = frame_length(link.held);
+    if (len && (*len == 0 || link.held.size() < *len))
+        return std::nullopt;
+    std::optional<tool_frame> frame = len ? take_frame(link, *len) : std::nullopt;
+    none = !frame;
+    if (!frame) {
+        why = "what " + link.where + " sent is not a frame. Is it a " +
+              (link.server ? "log server?" : "device's log daemon that listens there?");
+        return std::nullopt;
+    }
+    tool_log_frame("received", frame->control, frame->data.size());
+    if (link.server && link.with_device && tool_msgid(frame->control) == "device") {
+        none = true;
+        why = "the log server says: " + tool_answer_text(tool_read_answer(frame->control, "device"), nullptr, "Result");
+        return std::nullopt;
+    }
+    return frame;
 }
 
 } // namespace
@@ -204,12 +236,6 @@ std::string tool_address(int fd, decltype(getsockname) *end)
     return text.starts_with("::ffff:") ? text.substr(7) : text;
 }
 
-tool_link tool_called_link(unique_fd fd, const tool_limits &limits)
-{
-    std::string where = tool_address(fd.get(), getpeername);
-    return {.fd = std::move(fd), .where = std::move(where), .called = true, .limits = limits, .held = {}};
-}
-
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why)
 {
     tool_log_frame("sent", control, data.size());
@@ -242,20 +268,23 @@ bool tool_send(tool_link &link, const std::string &control, std::span<const unsi
 
 std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why)
 {
+    bool none = false;
     for (;;) {
-        const std::optional<std::size_t> len = frame_length(link.held);
-        if (len && (*len == 0 || link.held.size() < *len)) {
-            if (!receive_some(link, first, why))
-                return std::nullopt;
-            continue;
-        }
-        std::optional<tool_frame> frame = len ? take_frame(link, *len) : std::nullopt;
-        if (!frame)
-            why = "what " + link.where + " sent is not a frame. Is it a device's log daemon that " +
-                  (link.called ? "calls?" : "listens there?");
-        else
-            tool_log_frame("received", frame->control, frame->data.size());
-        return frame;
+        if (std::optional<tool_frame> frame = held_frame(link, none, why); frame || none)
+            return frame;
+        if (!receive_some(link, first, why))
+            return std::nullopt;
+    }
+}
+
+std::optional<tool_frame> tool_receive_now(tool_link &link, short &wanted, std::string &why)
+{
+    bool none = false;
+    for (;;) {
+        if (std::optional<tool_frame> frame = held_frame(link, none, why); frame || none)
+            return frame;
+        if (!take_some(link, wanted, why))
+            return std::nullopt;
     }
 }
 

@@ -29,7 +29,8 @@ struct tool_link {
     unique_fd fd;
     tls_session session = nullptr; /* over TLS; ends before its socket */
     std::string where;             /* the device's address and port, for messages */
-    bool called = false;           /* it was the device that made the connection */
+    bool server = false;           /* the log server is at the other end, and the device behind it */
+    bool with_device = false;      /* which it has given us */
     tool_limits limits;
     std::vector<unsigned char> held;                            /* received bytes behind the frames that were taken */
     std::unique_ptr<log_msg> msg = std::make_unique<log_msg>(); /* the frame being sent, or taken last */
@@ -50,15 +51,15 @@ void tool_set_keepalive(int fd);
 /* The address of an end of a connection, getsockname or getpeername; of an IPv4 one as such, whatever the socket. */
 std::string tool_address(int fd, decltype(getsockname) *end);
 
-/* The link that a device has made to us, on its accepted, non-blocking socket. */
-tool_link tool_called_link(unique_fd fd, const tool_limits &limits);
-
 /* Sends one frame. */
 bool tool_send(tool_link &link, const std::string &control, std::span<const unsigned char> data, std::string &why);
 
 /* Waits for the next frame, `first` for its first byte: link.limits.reply for an answer, link.limits.stall inside a
  * transfer. */
 std::optional<tool_frame> tool_receive(tool_link &link, std::chrono::milliseconds first, std::string &why);
+
+/* The next frame if it is there; else none, and `wanted` says what to wait for, or `why` why there will be none. */
+std::optional<tool_frame> tool_receive_now(tool_link &link, short &wanted, std::string &why);
 
 /* As recv(), without waiting: takes bytes that a frame was read ahead of, or what there is. With EAGAIN, `wanted`
  * says what to wait for. */

@@ -60,15 +60,14 @@ struct stream_result {
 /* Why the device is lost. */
 std::string lost(const tool_link &link)
 {
-    return "the connection to " + link.where + " ended. " +
-           (link.called
-                ? "Its log daemon ends with it, and the stream, too"
-                : "Another log tool may have taken it over; until one has it stop (stream LOG --stop), the device "
-                  "goes on streaming to this PC");
+    return "the connection to " + link.where +
+           " ended. Another log tool may have taken it over; until one has it stop (stream LOG --stop), the device goes on "
+           "streaming to this PC";
 }
 
-/* Passes on what comes until the user, the time, the device or the stream's own end ends it. */
-void relay(tool_link &control, tool_stream_source &source, const stream_output &out, tool_clock::time_point end,
+/* Passes on what comes until the user, the time, the device or the stream's own end ends it. Without a control link, the
+ * stream is the log server's. */
+void relay(tool_link *control, tool_stream_source &source, const stream_output &out, tool_clock::time_point end,
            stream_result &result)
 {
     auto told = result.over ? end : std::min<tool_clock::time_point>(end, tool_clock::now() + kFirstBytes);
@@ -80,7 +79,7 @@ void relay(tool_link &control, tool_stream_source &source, const stream_output &
         if (n < 0 || !write_patiently(out.fd(), out.shown(bytes), result.why))
             return;
         result.bytes += static_cast<std::uint64_t>(n);
-        pollfd sockets[] = {{control.fd.get(), POLLIN, 0}, {source.fd(), wanted, 0}};
+        pollfd sockets[] = {{control != nullptr ? control->fd.get() : -1, POLLIN, 0}, {source.fd(), wanted, 0}};
         const auto until = n > 0 ? tool_clock::now() : result.bytes == 0 ? told : end;
         const tool_wait event = tool_wait_for(sockets, until);
         if (event == tool_wait::interrupted || tool_clock::now() >= end)
@@ -88,21 +87,22 @@ void relay(tool_link &control, tool_stream_source &source, const stream_output &
         if (event == tool_wait::timeout && n == 0) {
             std::fprintf(stderr, "nothing has come yet; still waiting\n");
             told = end;
-        } else if (sockets[0].revents != 0 && !tool_still_there(control)) {
+        } else if (sockets[0].revents != 0 && !tool_still_there(*control)) {
             result.device_lost = true;
-            result.why = lost(control);
+            result.why = lost(*control);
             return;
         }
     }
 }
 
-/* Passes on what was under way when the device was told to stop; it ends its link then. */
-void drain(tool_link &control, tool_stream_source &source, const stream_output &out, stream_result &result)
+/* Passes on what was under way when the log server was told to stop; it says when that is all. */
+void drain(tool_stream_source &source, const stream_output &out, stream_result &result)
 {
     stream_result rest;
     rest.over = true;
-    relay(control, source, out, tool_clock::now() + control.limits.stall, rest);
+    relay(nullptr, source, out, tool_clock::now() + source.link->limits.stall, rest);
     result.bytes += rest.bytes;
+    result.why = rest.why;
 }
 
 /* Opens what the log goes to; false, and why, when it cannot go there. */
@@ -137,7 +137,7 @@ int tool_stream(tool_device &device, const tool_stream_options &options)
         return stop_only(device, options.log);
     stream_output out;
     stream_result result;
-    if (!open_output(options, out, result.why) || !tool_reach(device, result.why))
+    if (!open_output(options, out, result.why) || (!tool_has_server(device) && !tool_reach(device, result.why)))
         return tool_fail(kNoAnswer, result.why);
     tool_catch_interrupts();
     tool_stream_source source;
@@ -147,14 +147,15 @@ int tool_stream(tool_device &device, const tool_stream_options &options)
         std::fflush(stdout);
         std::fprintf(stderr, "The device says that it streams; Ctrl-C ends it.\n");
         const auto length = options.length.count() > 0 ? options.length : std::chrono::milliseconds(kForEver);
-        relay(*device.link, source, out, tool_clock::now() + length, result);
+        relay(device.link ? &*device.link : nullptr, source, out, tool_clock::now() + length, result);
     }
     tool_forget_interrupts();
-    if (started.asked && !result.device_lost && device.link) {
-        const std::string wrong = tool_stream_end(device, options.log, !started.answered);
+    if (started.asked && !result.device_lost && (device.link || source.link) &&
+        !(result.over && tool_has_server(device))) {
+        const std::string wrong = tool_stream_end(device, source, options.log, !started.answered);
         result.why += (result.why.empty() || wrong.empty() ? "" : "; ") + wrong;
-        if (device.called_at != nullptr && source.opened() && !result.over && wrong.empty())
-            drain(*device.link, source, out, result);
+        if (tool_has_server(device) && wrong.empty())
+            drain(source, out, result);
     }
     if (result.device_lost)
         device.link.reset();

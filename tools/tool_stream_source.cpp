@@ -46,80 +46,23 @@ std::optional<tool_link> connect_to_modem_log(const tool_device &device, const t
     return link;
 }
 
-/* Confirms a data link to the device, which has the stream's log program started. */
-bool confirm(tool_call &call, const char *connect_type, std::string &why)
+/* Has the log server pass the log on. */
+tool_stream_start begin_at_server(tool_device &device, const std::string &log, FILE *replies,
+                                  tool_stream_source &source)
 {
-    const std::string imei = tool_announced(call, "DataLink", "imei");
-    return tool_send(call.link, tool_command("10", "DataLink", {{"imei", imei}, {"ConnectType", connect_type}}), {},
-                     why);
-}
-
-/* Whether a call is the stream's data link, and can still be; else it is told of. */
-bool is_for(const std::optional<tool_call> &call, const tool_device &device, const char *connect_type,
-            const std::string &wrong)
-{
-    if (!call)
-        std::fprintf(stderr, "%s\n", wrong.c_str());
-    else if (tool_announced(*call, "DataLink", "ConnectType") != connect_type ||
-             tool_announced(*call, "DataLink", "imei") != device.imei)
-        std::fprintf(stderr, "%s called, but not for this stream\n", call->link.where.c_str());
-    else
-        return true;
-    return false;
-}
-
-/* Why no data link has come. */
-std::string not_called(const tool_device &device, tool_wait event)
-{
-    if (event == tool_wait::interrupted)
-        return "interrupted";
-    if (event == tool_wait::ready)
-        return "the device has hung up";
-    return "the device said that it streams, but did not call for it within " + tool_seconds(device.limits.reply) +
-           ". Can it reach " + tool_address(device.link->fd.get(), getsockname) + " port " + device.called_at->port +
-           "?";
-}
-
-/* Waits for the data link that the device makes for the stream, and confirms it. */
-std::optional<tool_link> await_data_link(tool_device &device, const std::string &log, std::string &why)
-{
-    const char *const connect_type = log == "syslog" ? "syslog_connect" : "modemlog_connect";
-    const auto end = tool_clock::now() + device.limits.reply;
-    for (;;) {
-        pollfd sockets[] = {{device.called_at->fd.get(), POLLIN, 0}, {device.link->fd.get(), POLLIN, 0}};
-        const tool_wait event = tool_wait_for(sockets, end);
-        if (event != tool_wait::ready || (sockets[1].revents != 0 && !tool_still_there(*device.link))) {
-            why = not_called(device, event);
-            return std::nullopt;
-        }
-        if (sockets[0].revents == 0)
-            continue;
-        std::string wrong;
-        std::optional<tool_call> call = tool_take_call(*device.called_at, device.limits, end, wrong);
-        if (!is_for(call, device, connect_type, wrong))
-            continue;
-        if (confirm(*call, connect_type, wrong))
-            return std::move(call->link);
-        std::fprintf(stderr, "%s\n", wrong.c_str()); /* of an earlier stream, perhaps: another link may come */
-    }
-}
-
-/* Hangs up on those that wait: data links of streams that were broken off, which would be taken for the next one's. */
-void clear_calls(const tool_listener &listener)
-{
-    while (unique_fd{accept4(listener.fd.get(), nullptr, nullptr, SOCK_CLOEXEC)})
-        continue;
-}
-
-std::string start_command(const tool_device &device, const std::string &log)
-{
-    if (device.called_at == nullptr)
-        return tool_command("6", "realtimeLog", {{"LogType", log}, {"Action", "start"}});
-    return tool_command("6", "realtimeLog",
-                        {{"LogType", log},
-                         {"Action", "start"},
-                         {"ip", tool_address(device.link->fd.get(), getsockname)},
-                         {"port", device.called_at->port}});
+    tool_stream_start state;
+    tool_frame answer;
+    source.link = tool_ask_server(device.server, device.limits,
+                                  {{"msgid", "stream"},
+                                   {"imei", device.imei},
+                                   {"LogType", log},
+                                   {"wait", std::to_string(device.server.wait.count())}},
+                                  answer, state.why);
+    state.asked = state.answered = source.link.has_value();
+    if (source.link && device.json)
+        std::fprintf(replies, "%.*s\n", static_cast<int>(answer.data.size()),
+                     reinterpret_cast<const char *>(answer.data.data()));
+    return state;
 }
 
 /* Whether a datagram comes from the device that was asked. */
@@ -148,19 +91,42 @@ ssize_t take_line(int fd, const tool_link &control, std::string &bytes)
     return static_cast<ssize_t>(bytes.size());
 }
 
+/* Takes what the log server passes on. */
+ssize_t take_passed_on(tool_link &link, std::string &bytes, short &wanted, std::string &why)
+{
+    bytes.clear();
+    while (const std::optional<tool_frame> frame = tool_receive_now(link, wanted, why)) {
+        const json_tree root{cJSON_ParseWithLength(frame->control.data(), frame->control.size())};
+        const char *const missed = cJSON_GetStringValue(cJSON_GetObjectItem(root.get(), "missed"));
+        const char *const result = cJSON_GetStringValue(cJSON_GetObjectItem(root.get(), "Result"));
+        if (missed != nullptr)
+            std::fprintf(stderr, "%s bytes were left out here: they were not taken in time\n",
+                         tool_printable(missed).c_str());
+        if (result != nullptr) {
+            why = std::string_view(result) == "Success" ? "" : tool_printable(std::string(result).substr(5));
+            return -1;
+        }
+        bytes.assign(frame->data.begin(), frame->data.end());
+        if (!bytes.empty())
+            return static_cast<ssize_t>(bytes.size());
+    }
+    return why.empty() ? 0 : -1;
+}
+
 } // namespace
 
 tool_stream_start tool_stream_begin(tool_device &device, const std::string &log, FILE *replies,
                                     tool_stream_source &source)
 {
+    if (tool_has_server(device))
+        return begin_at_server(device, log, replies, source);
     tool_stream_start state;
-    const bool datagrams = log == "syslog" && device.called_at == nullptr;
+    const bool datagrams = log == "syslog";
     if (datagrams && !(source.datagrams = open_datagrams(*device.link, state.why)))
         return state;
-    if (device.called_at != nullptr)
-        clear_calls(*device.called_at);
     state.asked = true;
-    const std::optional<tool_answer> answer = tool_exchange(device, start_command(device, log), {}, state.why);
+    const std::optional<tool_answer> answer = tool_exchange(
+        device, tool_command("6", "realtimeLog", {{"LogType", log}, {"Action", "start"}}), {}, state.why);
     state.answered = answer.has_value();
     if (!answer)
         return state;
@@ -170,8 +136,6 @@ tool_stream_start tool_stream_begin(tool_device &device, const std::string &log,
         state.asked = false;
         state.status = kDeviceSaidNo;
         state.why = tool_said(device, *answer);
-    } else if (device.called_at != nullptr) {
-        source.link = await_data_link(device, log, state.why);
     } else if (!datagrams) {
         source.link = connect_to_modem_log(device, *answer, state.why);
     }
@@ -183,10 +147,14 @@ std::string tool_stream_end_command(const std::string &log)
     return tool_command("6", "realtimeLog", {{"LogType", log}, {"Action", "end"}, {"ip", ""}, {"port", "0"}});
 }
 
-std::string tool_stream_end(tool_device &device, const std::string &log, bool answer_due)
+std::string tool_stream_end(tool_device &device, tool_stream_source &source, const std::string &log, bool answer_due)
 {
     constexpr char kMayStream[] = "the device may still be streaming: ";
     std::string why;
+    if (tool_has_server(device)) {
+        tool_send(*source.link, R"({"msgid":"stream","Action":"end"})", {}, why);
+        return why;
+    }
     if (answer_due && !tool_receive(*device.link, device.limits.reply, why))
         return kMayStream + why;
     const std::optional<tool_answer> answer = tool_exchange(device, tool_stream_end_command(log), {}, why);
@@ -195,12 +163,14 @@ std::string tool_stream_end(tool_device &device, const std::string &log, bool an
     return why.empty() ? "" : kMayStream + why;
 }
 
-ssize_t tool_stream_take(tool_stream_source &source, const tool_link &control, std::string &bytes, short &wanted,
+ssize_t tool_stream_take(tool_stream_source &source, const tool_link *control, std::string &bytes, short &wanted,
                          std::string &why)
 {
     wanted = POLLIN;
     if (source.datagrams)
-        return take_line(source.datagrams.get(), control, bytes);
+        return take_line(source.datagrams.get(), *control, bytes);
+    if (source.link->server)
+        return take_passed_on(*source.link, bytes, wanted, why);
     bytes.resize(kPieceMax);
     const ssize_t n =
         tool_read_some(*source.link, {reinterpret_cast<unsigned char *>(bytes.data()), bytes.size()}, wanted);

@@ -2,6 +2,7 @@
 
 #include <cerrno>
 #include <openssl/err.h>
+#include <openssl/x509v3.h>
 
 namespace
 {
@@ -24,15 +25,15 @@ std::string handshake_error(const SSL *session)
     const int reason = ERR_GET_REASON(ERR_peek_last_error());
     std::string text = "TLS handshake failed: " + last_error();
     if (reason == SSL_R_WRONG_VERSION_NUMBER || reason == SSL_R_HTTP_REQUEST)
-        text += ". It does not seem to speak TLS; for a device without, there is --plain";
+        text += ". It does not seem to speak TLS; one without is served with --plain";
     return text;
 }
 
-} // namespace
-
-tls_context tool_tls_server(const std::string &cert, const std::string &key, const std::string &ca, std::string &why)
+/* A context that demands the other side's certificate. */
+tls_context make_context(const SSL_METHOD *method, const std::string &cert, const std::string &key,
+                         const std::string &ca, std::string &why)
 {
-    tls_context context{SSL_CTX_new(TLS_server_method())};
+    tls_context context{SSL_CTX_new(method)};
     if (!context) {
         why = "cannot begin with TLS: " + last_error();
         return nullptr;
@@ -52,9 +53,9 @@ tls_context tool_tls_server(const std::string &cert, const std::string &key, con
     return nullptr;
 }
 
-tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why)
+/* Shakes hands by the library's own procedure for one side. */
+tls_session shake_hands(tls_session session, int fd, int (*step)(SSL *), tool_clock::time_point end, std::string &why)
 {
-    tls_session session{SSL_new(context)};
     if (!session || SSL_set_fd(session.get(), fd) != 1) {
         why = "TLS handshake failed: " + last_error();
         return nullptr;
@@ -63,7 +64,7 @@ tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end
         ERR_clear_error();
         errno = 0;
         short wanted = 0;
-        if (tool_tls_result(session.get(), SSL_accept(session.get()), wanted) > 0)
+        if (tool_tls_result(session.get(), step(session.get()), wanted) > 0)
             return session;
         pollfd entry{fd, wanted, 0};
         if (wanted == 0)
@@ -76,6 +77,32 @@ tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end
             continue;
         return nullptr;
     }
+}
+
+} // namespace
+
+tls_context tool_tls_client(const std::string &cert, const std::string &key, const std::string &ca, std::string &why)
+{
+    return make_context(TLS_client_method(), cert, key, ca, why);
+}
+
+tls_context tool_tls_server(const std::string &cert, const std::string &key, const std::string &ca, std::string &why)
+{
+    return make_context(TLS_server_method(), cert, key, ca, why);
+}
+
+tls_session tool_tls_connect(SSL_CTX *context, int fd, const std::string &host, tool_clock::time_point end,
+                             std::string &why)
+{
+    tls_session session{SSL_new(context)};
+    if (session && X509_VERIFY_PARAM_set1_ip_asc(SSL_get0_param(session.get()), host.c_str()) != 1)
+        SSL_set1_host(session.get(), host.c_str());
+    return shake_hands(std::move(session), fd, SSL_connect, end, why);
+}
+
+tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why)
+{
+    return shake_hands(tls_session{SSL_new(context)}, fd, SSL_accept, end, why);
 }
 
 ssize_t tool_tls_result(SSL *session, int result, short &wanted)

@@ -1,4 +1,4 @@
-/* TLS as a log server speaks it: it shows its certificate and demands the device's. */
+/* TLS: the tool's, which shows an operator's certificate to a log server. */
 #ifndef TOOLS_TOOL_TLS_H
 #define TOOLS_TOOL_TLS_H
 
@@ -23,11 +23,15 @@ struct tls_session_deleter {
 using tls_context = std::unique_ptr<SSL_CTX, tls_context_deleter>;
 using tls_session = std::unique_ptr<SSL, tls_session_deleter>;
 
-/* A context from PEM files: the server's certificate and key, and the certificate that a device's must be signed by.
- * None, and why, when they cannot be used. */
+/* A context from PEM files: our certificate and key, and the certificate that the other side's must be signed by. None,
+ * and why, when they cannot be used. */
+tls_context tool_tls_client(const std::string &cert, const std::string &key, const std::string &ca, std::string &why);
 tls_context tool_tls_server(const std::string &cert, const std::string &key, const std::string &ca, std::string &why);
 
-/* Shakes hands on an accepted, non-blocking socket until `end`. None, and why, when that fails. */
+/* Shakes hands on a connected, non-blocking socket until `end`: with a server, whose certificate must be for `host`, or
+ * with a client. None, and why, when that fails. */
+tls_session tool_tls_connect(SSL_CTX *context, int fd, const std::string &host, tool_clock::time_point end,
+                             std::string &why);
 tls_session tool_tls_accept(SSL_CTX *context, int fd, tool_clock::time_point end, std::string &why);
 
 /* A result as recv() and send() have it: bytes, 0 at the end, -1 with errno, EAGAIN when the socket is to be waited

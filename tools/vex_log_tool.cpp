@@ -3,8 +3,9 @@
 #include "tools/tool_commands.h"
 #include "tools/tool_config.h"
 #include "tools/tool_log.h"
+#include "tools/tool_many.h"
 #include "tools/tool_process.h"
-#include "tools/tool_serve.h"
+#include "tools/tool_server.h"
 #include "tools/tool_stream.h"
 
 #include <CLI/CLI.hpp>
@@ -14,6 +15,8 @@
 
 namespace
 {
+
+constexpr char kServerSocket[] = "/run/vex_log_server.sock";
 
 /* What is asked of the device; the exit status. */
 using tool_job = std::function<int(tool_device &)>;
@@ -38,21 +41,15 @@ void add_limit(CLI::App &app, const char *name, std::chrono::milliseconds &limit
         ->default_str(limit.count() > 0 ? std::to_string(limit.count() / 1000) : "");
 }
 
-/* The options of every command, whoever made the connection. */
-void add_output_options(CLI::App &app, tool_device &device)
+void add_common_options(CLI::App &app, tool_device &device)
 {
+    app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
+    app.add_option("--port", device.port, "port of its log daemon")->check(CLI::Range(1, 65535))->capture_default_str();
     app.add_flag("--json", device.json, "print the device's reply as it came");
     app.add_flag_callback("--debug", tool_log_show, "show on standard error what goes over the wire");
     add_limit(app, "--connect-timeout", device.limits.connect, "longest wait for a connection");
     add_limit(app, "--reply-timeout", device.limits.reply, "longest wait for an answer");
     add_limit(app, "--stall-timeout", device.limits.stall, "longest pause inside a transfer");
-}
-
-void add_common_options(CLI::App &app, tool_device &device)
-{
-    app.add_option("--host", device.host, "address or name of the device")->capture_default_str();
-    app.add_option("--port", device.port, "port of its log daemon")->check(CLI::Range(1, 65535))->capture_default_str();
-    add_output_options(app, device);
 }
 
 /* What the command line says beside the command. */
@@ -82,7 +79,7 @@ void add_capture(CLI::App &app, tool_words &words, tool_job &job)
 void add_transfers(CLI::App &app, tool_words &words, tool_job &job)
 {
     CLI::App *archive = app.add_subcommand("archive", "fetch all the device's logs as a gzip tar");
-    archive->add_option("FILE", words.first, "where to store it")->required();
+    archive->add_option("FILE", words.first, "where to store it; with several devices, a folder")->required();
     archive->add_option("--tries", words.tries, "how often the device may fail to pack them")
         ->check(CLI::PositiveNumber)
         ->capture_default_str();
@@ -136,53 +133,58 @@ void add_commands(CLI::App &app, tool_words &words, tool_job &job)
     add_transfers(app, words, job);
 }
 
-/* Runs a command line for a device that has called. What it says of output and limits holds for itself only. */
-int run_line(tool_device &device, const std::string &line)
+/* Which devices behind a log server it is for. */
+struct tool_choice {
+    std::vector<std::string> imeis;
+    bool all = false;
+    unsigned parallel = 8;
+    bool list = false; /* it is for none: they are to be listed */
+    bool watch = false;
+};
+
+void add_server_options(CLI::App &app, tool_device &device, tool_choice &choice)
 {
-    if (line.starts_with("raw {")) /* JSON as it is: quotes and blanks are its own */
-        return tool_raw(device, line.substr(4));
-    const bool json = device.json;
-    const tool_limits limits = device.limits;
-    tool_words words;
-    tool_job job;
-    CLI::App app{"Commands for the device that has called."};
-    app.fallthrough();
-    add_output_options(app, device);
-    add_commands(app, words, job);
-    int status = 0;
-    try {
-        app.parse(line);
-        device.link->limits = device.limits;
-        status = job(device);
-    } catch (const CLI::ParseError &error) {
-        if (error.get_exit_code() != 0)
-            std::fprintf(stderr, "%s:\n", line.c_str());
-        status = app.exit(error);
-    }
-    device.json = json;
-    device.limits = limits;
-    return status;
+    tool_server &server = device.server;
+    CLI::Option *const host = app.get_option("--host");
+    app.add_option("--server", server.address,
+                   "the log server that the device has called: a unix socket's path, or ADDRESS:PORT")
+        ->envname("VEX_LOG_SERVER")
+        ->type_name("ADDRESS");
+    CLI::Option *const all = app.add_flag("--all", choice.all, "all devices that are connected to the server")->excludes(host);
+    app.add_option("--device", choice.imeis, "IMEI of the device; may be given several times")->excludes(host)->excludes(all);
+    app.add_option("--parallel", choice.parallel, "how many devices at a time")
+        ->check(CLI::Range(1, 256))
+        ->capture_default_str();
+    app.add_option_function<long>(
+           "--wait", [&server](long s) { server.wait = std::chrono::seconds(s); },
+           "how long to wait for a device that is not connected")
+        ->check(CLI::Range(0, 86400))
+        ->type_name("SECONDS");
+    for (const auto &[name, file, help] : {std::tuple{"--cert", &server.cert, "an operator's certificate, a PEM file"},
+                                           {"--key", &server.key, "its key"},
+                                           {"--ca", &server.ca, "certificate that the server's is signed by"}})
+        app.add_option(name, *file, help)->check(CLI::ExistingFile);
+    CLI::App *const devices = app.add_subcommand("devices", "list the devices that are connected to the log server");
+    devices->add_flag("--watch", choice.watch, "and go on with who calls and who leaves");
+    devices->callback([&choice] { choice.list = true; });
 }
 
-void add_serve(CLI::App &app, tool_serve_options &options, tool_job &job)
+/* Has the job done for the devices that are meant. */
+int run(tool_device &device, const tool_choice &choice, const tool_job &job)
 {
-    CLI::App *serve = app.add_subcommand("serve", "be the log server that a device calls, and take commands for it");
-    serve->add_option("--listen", options.port, "port to be called at")
-        ->check(CLI::Range(1, 65535))
-        ->capture_default_str();
-    CLI::Option *plain = serve->add_flag("--plain", options.plain, "without TLS");
-    const auto add_file = [&](const char *name, std::string &file, const char *help) {
-        serve->add_option(name, file, help)->check(CLI::ExistingFile)->excludes(plain);
-    };
-    add_file("--cert", options.cert, "our certificate, a PEM file");
-    add_file("--key", options.key, "its key");
-    add_file("--ca", options.ca, "certificate that the devices' are signed by");
-    serve->callback([&] {
-        if (app.count("--host") + app.count("--port") > 0)
-            throw CLI::ValidationError(
-                "serve is called by devices, at the port of --listen; it has no --host or --port");
-        job = [&](tool_device &device) { return tool_serve(device, options, run_line); };
-    });
+    if (device.server.address.empty() && (choice.all || choice.list || !choice.imeis.empty()))
+        device.server.address = kServerSocket;
+    if (choice.list)
+        return tool_devices(device.server, device.limits, device.json, choice.watch);
+    if (choice.all)
+        return tool_for_all(device, choice.parallel, job);
+    if (choice.imeis.size() > 1)
+        return tool_for_many(device, choice.imeis, choice.parallel, job);
+    if (choice.imeis.empty() && tool_has_server(device))
+        return tool_fail(kNoAnswer, "which device behind the log server? Name it with --device, or take --all");
+    if (!choice.imeis.empty())
+        device.imei = choice.imeis.front();
+    return job(device);
 }
 
 } // namespace
@@ -193,14 +195,14 @@ int main(int argc, char **argv)
     tool_device device;
     tool_words words;
     tool_job job;
-    tool_serve_options serve;
+    tool_choice choice;
     CLI::App app{"Controls and collects the diagnostic logs of a device."};
     app.set_version_flag("--version", "vex_log_tool " VEX_VERSION);
     app.fallthrough(); /* common options may follow the command, too */
     add_common_options(app, device);
     add_commands(app, words, job);
-    add_serve(app, serve, job);
+    add_server_options(app, device, choice);
 
     CLI11_PARSE(app, argc, argv);
-    return tool_exit_status(job(device));
+    return tool_exit_status(run(device, choice, job));
 }

@@ -1,4 +1,4 @@
-#include "tools/tool_listener.h"
+#include "device/log_server.h"
 
 #include "tools/tool_answer.h"
 
@@ -30,6 +30,12 @@ unique_fd listen_at(const sockaddr *address, socklen_t len)
 }
 
 } // namespace
+
+tool_link tool_called_link(unique_fd fd, const tool_limits &limits)
+{
+    std::string where = tool_address(fd.get(), getpeername);
+    return {.fd = std::move(fd), .where = std::move(where), .limits = limits, .held = {}};
+}
 
 bool tool_listen(tool_listener &listener, std::string &why)
 {

@@ -1,6 +1,6 @@
-/* The place at which a log server is called by devices. */
-#ifndef TOOLS_TOOL_LISTENER_H
-#define TOOLS_TOOL_LISTENER_H
+/* A log server as small as can be, for tests and benchmarks: the place at which it is called by devices. */
+#ifndef DEVICE_LOG_SERVER_H
+#define DEVICE_LOG_SERVER_H
 
 #include "protocol/json_tree.h"
 #include "tools/tool_link.h"
@@ -27,6 +27,9 @@ struct tool_call {
  * why, when there is no talking to the caller. */
 std::optional<tool_call> tool_take_call(const tool_listener &listener, const tool_limits &limits,
                                         tool_clock::time_point end, std::string &why);
+
+/* The link that a device has made to us, on its accepted, non-blocking socket. */
+tool_link tool_called_link(unique_fd fd, const tool_limits &limits);
 
 /* The printable text of a member of the object `group` in what a caller announced. */
 std::string tool_announced(const tool_call &call, const char *group, const char *name);

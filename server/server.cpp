@@ -1,0 +1,63 @@
+#include "server/server.h"
+
+#include "server/fleet.h"
+#include "server/store.h"
+
+#include <poll.h>
+#include <unistd.h>
+
+int server_log_fd = STDERR_FILENO;
+
+namespace
+{
+
+/* Writes what is taken at once: a reader that stalls must not stop the server. */
+void write_line(std::string line)
+{
+    static std::uint64_t lost = 0;
+    pollfd entry{server_log_fd, POLLOUT, 0};
+    if (poll(&entry, 1, 0) != 1 || (entry.revents & POLLOUT) == 0) {
+        ++lost;
+        return;
+    }
+    if (lost > 0)
+        line = std::to_string(std::exchange(lost, 0)) + " lines were lost\n" + line;
+    static_cast<void>(!write(server_log_fd, line.data(), line.size()));
+}
+
+} // namespace
+
+server::server(asio::io_context &context, const server_options &chosen)
+    : io(context), options(chosen), devices(std::make_unique<fleet>(*this))
+{
+}
+
+server::~server() = default;
+
+void server_log(const char *what, std::initializer_list<std::pair<const char *, std::string>> members)
+{
+    std::string line = what;
+    for (const auto &[name, value] : members)
+        line += std::string(" ") + name + "=\"" + tool_printable(value) + '"';
+    write_line(line + '\n');
+}
+
+void server_event(server &server, const char *what, std::initializer_list<std::pair<const char *, std::string>> members)
+{
+    server_log(what, members);
+    if (!server.store)
+        return;
+    char time[32];
+    const std::time_t now = std::time(nullptr);
+    std::tm utc{};
+    gmtime_r(&now, &utc);
+    std::strftime(time, sizeof time, "%Y-%m-%dT%H:%M:%SZ", &utc);
+    const json_tree root{cJSON_CreateObject()};
+    cJSON_AddStringToObject(root.get(), "time", time);
+    cJSON_AddStringToObject(root.get(), "event", what);
+    for (const auto &[name, value] : members)
+        cJSON_AddStringToObject(root.get(), name, value.c_str());
+    char *const printed = cJSON_PrintUnformatted(root.get());
+    server.store->event(printed != nullptr ? printed : "");
+    cJSON_free(printed);
+}

@@ -1,0 +1,307 @@
+#include "server/store.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <ctime>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace fs = std::filesystem;
+
+namespace
+{
+
+using namespace std::chrono_literals;
+
+constexpr std::size_t kFlushAt = 65536;
+constexpr std::size_t kLineMax = 8192; /* a longer line is broken */
+
+std::string utc_text(const char *format)
+{
+    char text[32];
+    const std::time_t now = std::time(nullptr);
+    std::tm utc{};
+    gmtime_r(&now, &utc);
+    std::strftime(text, sizeof text, format, &utc);
+    return text;
+}
+
+std::time_t to_time(fs::file_time_type time)
+{
+    return std::chrono::system_clock::to_time_t(
+        std::chrono::time_point_cast<std::chrono::system_clock::duration>(std::chrono::file_clock::to_sys(time)));
+}
+
+/* When a line came: "2026-11-23T12:00:00.123Z ". */
+std::string stamp()
+{
+    const auto now = std::chrono::system_clock::now().time_since_epoch();
+    const auto ms = std::chrono::duration_cast<std::chrono::milliseconds>(now).count() % 1000;
+    char text[16];
+    std::snprintf(text, sizeof text, ".%03dZ ", static_cast<int>(ms));
+    return utc_text("%Y-%m-%dT%H:%M:%S") + text;
+}
+
+} // namespace
+
+kept_file::kept_file(log_store &store, fs::path folder, std::string name, std::string suffix)
+    : store_(store), folder_(std::move(folder)), name_(std::move(name)), suffix_(std::move(suffix))
+{
+}
+
+kept_file::~kept_file()
+{
+    flush();
+    close();
+    store_.waiting_.erase(this);
+}
+
+void kept_file::append(std::string_view bytes)
+{
+    waiting_ += bytes;
+    if (waiting_.size() >= kFlushAt)
+        flush();
+    else
+        store_.waiting_.insert(this);
+}
+
+bool kept_file::open()
+{
+    std::error_code ignored;
+    fs::create_directories(folder_, ignored);
+    day_ = utc_text("%Y-%m-%d");
+    for (unsigned number = 0;; ++number) {
+        path_ = folder_ / (name_ + '-' + day_ + (number > 0 ? '.' + std::to_string(number) : "") + suffix_);
+        size_ = fs::exists(path_, ignored) ? fs::file_size(path_, ignored) : 0;
+        if (size_ < store_.home.options.rotate_size)
+            break;
+    }
+    fd_ = ::open(path_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC | O_NOFOLLOW, 0640);
+    return fd_ != -1;
+}
+
+void kept_file::flush()
+{
+    if (waiting_.empty())
+        return;
+    if (fd_ != -1 && (size_ >= store_.home.options.rotate_size || day_ != utc_text("%Y-%m-%d")))
+        close();
+    store_.make_room(waiting_.size());
+    std::size_t done = 0;
+    if (fd_ != -1 || open()) {
+        while (done < waiting_.size()) {
+            const ssize_t n = write(fd_, waiting_.data() + done, waiting_.size() - done);
+            if (n < 0 && errno != EINTR)
+                break;
+            done += static_cast<std::size_t>(std::max<ssize_t>(n, 0));
+        }
+    }
+    if (done < waiting_.size()) {
+        why_lost_ = std::strerror(errno);
+        lost_ += waiting_.size() - done;
+        store_.home.metrics.store_bytes_lost += waiting_.size() - done;
+    }
+    size_ += done;
+    waiting_.clear();
+    if (fd_ != -1)
+        store_.grew(path_, done, this);
+}
+
+void kept_file::close()
+{
+    if (fd_ == -1)
+        return;
+    ::close(fd_);
+    fd_ = -1;
+    store_.closed(path_);
+}
+
+stored_log::stored_log(log_store &store, const std::string &imei, log_kind kind, std::time_t last)
+    : store_(store), imei_(imei), kind_(kind), file_(store, fs::path(store.home.options.store) / imei, log_name(kind),
+                                                     kind == log_kind::syslog ? ".log" : ".bin"),
+      since_(last)
+{
+}
+
+void stored_log::append_lines(std::string_view bytes)
+{
+    const std::string now = stamp();
+    while (!bytes.empty()) {
+        if (line_.empty())
+            line_ = now;
+        const std::size_t newline = bytes.find('\n');
+        const std::size_t taken = std::min({newline == bytes.npos ? newline : newline + 1, bytes.size(), kLineMax});
+        line_ += bytes.substr(0, taken);
+        bytes.remove_prefix(taken);
+        if (!line_.ends_with('\n') && line_.size() < kLineMax)
+            continue;
+        if (!line_.ends_with('\n'))
+            line_ += '\n';
+        file_.append(line_);
+        line_.clear();
+    }
+}
+
+void stored_log::append(std::string_view bytes)
+{
+    tell_lost();
+    if (kind_ == log_kind::syslog)
+        append_lines(bytes);
+    else
+        file_.append(bytes);
+}
+
+/* Says what is missing: in the log itself where that is text, and among the events. */
+void stored_log::tell(const std::string &what)
+{
+    ++store_.home.metrics.log_gaps;
+    if (kind_ == log_kind::syslog)
+        file_.append(stamp() + "# vex_log_server: " + what + '\n');
+    server_event(store_.home, "gap", {{"imei", imei_}, {"log", log_name(kind_)}, {"what", what}});
+}
+
+void stored_log::tell_lost()
+{
+    const std::uint64_t lost = file_.take_lost();
+    if (lost == 0)
+        return;
+    if (kind_ == log_kind::syslog)
+        file_.append("\n"); /* a line may have been cut */
+    tell(std::to_string(lost) + " bytes are missing: " + file_.why_lost());
+}
+
+void stored_log::interrupted(const std::string &why)
+{
+    if (since_ != 0)
+        return;
+    since_ = std::time(nullptr);
+    why_ = why;
+    if (!line_.empty()) {
+        file_.append(line_ + '\n');
+        line_.clear();
+    }
+}
+
+void stored_log::resumed()
+{
+    if (since_ != 0)
+        tell("nothing came for " + std::to_string(std::time(nullptr) - since_) + " s: " + why_);
+    since_ = 0;
+}
+
+log_store::log_store(server &server) : home(server), folder_(server.options.store) {}
+
+log_store::~log_store()
+{
+    for (kept_file *const file : std::exchange(waiting_, {}))
+        file->flush();
+}
+
+std::unique_ptr<log_store> log_store::open(server &server, std::string &why)
+{
+    std::error_code error;
+    const fs::path folder = server.options.store;
+    fs::create_directories(folder, error);
+    if (error || access(folder.c_str(), R_OK | W_OK | X_OK) != 0) {
+        why = "cannot keep anything in " + folder.string() + ": " + (error ? error.message() : std::strerror(errno));
+        return nullptr;
+    }
+    std::unique_ptr<log_store> store(new log_store(server));
+    store->scan();
+    store->events_ = std::make_unique<kept_file>(*store, folder, "events", ".jsonl");
+    run_beside(server.io, store->tick());
+    return store;
+}
+
+void log_store::scan()
+{
+    std::error_code error;
+    for (fs::recursive_directory_iterator at(folder_, error), end; at != end; at.increment(error)) {
+        if (error || !at->is_regular_file(error))
+            continue;
+        const kept file{at->file_size(error), at->last_write_time(error), nullptr};
+        files_[at->path()] = file;
+        by_age_.emplace(file.time, at->path());
+        total_ += file.size;
+    }
+    make_room(0);
+}
+
+/* Writes once a second what waits. */
+task<void> log_store::tick()
+{
+    asio::steady_timer timer(home.io);
+    for (asio::error_code cancelled; !cancelled;) {
+        timer.expires_after(1s);
+        co_await timer.async_wait(await_into(cancelled));
+        for (kept_file *const file : std::exchange(waiting_, {}))
+            file->flush();
+        make_room(0);
+    }
+}
+
+void log_store::grew(const fs::path &path, std::uint64_t bytes, kept_file *writer)
+{
+    const auto [entry, fresh] = files_.try_emplace(path, kept{0, {}, nullptr});
+    kept &file = entry->second;
+    if (!fresh)
+        by_age_.erase({file.time, path});
+    file.time = fs::file_time_type::clock::now();
+    file.size += bytes;
+    file.writer = writer;
+    by_age_.emplace(file.time, path);
+    total_ += bytes;
+}
+
+void log_store::closed(const fs::path &path)
+{
+    if (const auto entry = files_.find(path); entry != files_.end())
+        entry->second.writer = nullptr;
+}
+
+/* Removes what is too old, or has to go for so many bytes more. */
+void log_store::make_room(std::uint64_t bytes)
+{
+    const auto oldest = [this](unsigned days) {
+        return days > 0 && by_age_.begin()->first < fs::file_time_type::clock::now() - std::chrono::hours(24 * days);
+    };
+    while (!by_age_.empty() && (total_ + bytes > home.options.store_limit || oldest(home.options.store_days)))
+        remove_oldest();
+}
+
+void log_store::remove_oldest()
+{
+    const fs::path path = by_age_.begin()->second;
+    const kept file = files_[path];
+    std::error_code error;
+    if (file.writer != nullptr)
+        file.writer->close();
+    fs::remove(path, error);
+    by_age_.erase(by_age_.begin());
+    files_.erase(path);
+    total_ -= file.size;
+}
+
+/* When a log was written to last; 0 when nothing of it is kept. */
+std::time_t log_store::last_write(const std::string &imei, log_kind kind) const
+{
+    const std::string start = (folder_ / imei / log_name(kind)).string() + '-';
+    std::time_t last = 0;
+    for (auto file = files_.lower_bound(start); file != files_.end() && file->first.string().starts_with(start); ++file)
+        last = std::max(last, to_time(file->second.time));
+    return last;
+}
+
+std::shared_ptr<stored_log> log_store::follow(const std::string &imei, log_kind kind)
+{
+    std::shared_ptr<stored_log> &log = logs_[{imei, kind}];
+    if (!log)
+        log = std::make_shared<stored_log>(*this, imei, kind, last_write(imei, kind));
+    return log;
+}
+
+void log_store::event(const std::string &line)
+{
+    events_->append(line + '\n');
+}
