@@ -181,6 +181,8 @@ void stored_log::interrupted(const std::string &why)
         file_.append(line_ + '\n');
         line_.clear();
     }
+    file_.flush();
+    file_.close(); /* it may be for good */
 }
 
 void stored_log::resumed()
