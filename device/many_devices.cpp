@@ -27,6 +27,8 @@ struct fleet_options {
     unsigned at_once = 64;                     /* that are about to connect */
     unsigned rate = 10;                        /* lines a second of a live log; 0: as fast as can be */
     unsigned restless = 0;                     /* seconds that a device stays, at most; 0: for ever */
+    unsigned handshakes = 0;                   /* only shake hands, so often, and hang up */
+    bool raw = false;                          /* send syslog lines and nothing else */
 };
 
 struct ssl_context_free {
@@ -195,6 +197,30 @@ task<void> one_device::live()
     }
 }
 
+/* Shakes hands with the server until that has been done often enough. */
+task<void> shake_hands(many_devices &all)
+{
+    while (all.next < all.options.handshakes) {
+        ++all.next;
+        const auto link = co_await call(all, all.options.host, all.options.port);
+        if (!link)
+            --all.next; /* refused: again */
+    }
+    if (--all.connected == 0)
+        all.io.stop();
+}
+
+/* Sends lines as a device's own syslogd would, to a syslog server. */
+task<void> send_lines(many_devices &all, unsigned number)
+{
+    const auto link = co_await call(all, all.options.host, all.options.port);
+    std::string lines;
+    for (int i = 0; i < 160; ++i)
+        lines += "<13>Nov 24 12:00:00 vex-device d" + std::to_string(number) + ": " + std::string(55, '.') + '\n';
+    for (bool more = link != nullptr; more;)
+        more = co_await link->send(lines);
+}
+
 /* Lets devices come to life one after the other, each when another has connected. */
 task<void> begin(many_devices &all)
 {
@@ -222,6 +248,8 @@ int main(int argc, char **argv)
     app.add_option("--at-once", options.at_once, "how many connect at a time")->capture_default_str();
     app.add_option("--rate", options.rate, "lines a second of a live log; 0: all it can")->capture_default_str();
     app.add_option("--restless", options.restless, "seconds that one stays, at most; 0: for ever");
+    app.add_option("--handshakes", options.handshakes, "only shake hands, so often");
+    app.add_flag("--raw", options.raw, "send syslog lines and nothing else");
     CLI11_PARSE(app, argc, argv);
     std::signal(SIGPIPE, SIG_IGN);
     rlimit limit{};
@@ -229,6 +257,13 @@ int main(int argc, char **argv)
     limit.rlim_cur = limit.rlim_max;
     setrlimit(RLIMIT_NOFILE, &limit);
     many_devices all(options);
-    run_beside(all.io, begin(all));
+    if (options.handshakes > 0)
+        for (all.connected = 0; all.connected < options.at_once; ++all.connected)
+            run_beside(all.io, shake_hands(all));
+    else if (options.raw)
+        for (unsigned i = 0; i < options.count; ++i)
+            run_beside(all.io, send_lines(all, i));
+    else
+        run_beside(all.io, begin(all));
     all.io.run();
 }

@@ -38,6 +38,7 @@ bool tls_endpoint::load(const std::string &cert, const std::string &key, const s
     /* Thousands of callers say nothing most of the time, and none comes back soon enough for a session to be kept. */
     SSL_CTX_set_mode(context.get(),
                      SSL_MODE_RELEASE_BUFFERS | SSL_MODE_ENABLE_PARTIAL_WRITE | SSL_MODE_ACCEPT_MOVING_WRITE_BUFFER);
+    SSL_CTX_set_read_ahead(context.get(), 1); /* a record with one call */
     SSL_CTX_set_session_cache_mode(context.get(), SSL_SESS_CACHE_OFF);
     SSL_CTX_set_num_tickets(context.get(), 0);
     SSL_CTX_set_options(context.get(), SSL_OP_NO_RENEGOTIATION);

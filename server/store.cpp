@@ -1,6 +1,9 @@
 #include "server/store.h"
 
+#include "server/compress.h"
+
 #include <algorithm>
+#include <asio/post.hpp>
 #include <cerrno>
 #include <cstring>
 #include <ctime>
@@ -14,6 +17,7 @@ namespace
 
 using namespace std::chrono_literals;
 
+constexpr auto kCompressLook = 60s; /* from one look for something to compress to the next */
 constexpr std::size_t kFlushAt = 65536;
 constexpr std::size_t kLineMax = 8192; /* a longer line is broken */
 
@@ -73,6 +77,8 @@ bool kept_file::open()
     day_ = utc_text("%Y-%m-%d");
     for (unsigned number = 0;; ++number) {
         path_ = folder_ / (name_ + '-' + day_ + (number > 0 ? '.' + std::to_string(number) : "") + suffix_);
+        if (fs::exists(path_.string() + kCompressedSuffix, ignored))
+            continue;
         size_ = fs::exists(path_, ignored) ? fs::file_size(path_, ignored) : 0;
         if (size_ < store_.home.options.rotate_size)
             break;
@@ -240,6 +246,7 @@ task<void> log_store::tick()
         for (kept_file *const file : std::exchange(waiting_, {}))
             file->flush();
         make_room(0);
+        compress_next();
     }
 }
 
@@ -272,17 +279,68 @@ void log_store::make_room(std::uint64_t bytes)
         remove_oldest();
 }
 
+/* Takes a file that is no more off the books. */
+void log_store::forget(const fs::path &path)
+{
+    const auto entry = files_.find(path);
+    if (entry == files_.end())
+        return;
+    by_age_.erase({entry->second.time, path});
+    total_ -= entry->second.size;
+    files_.erase(entry);
+}
+
 void log_store::remove_oldest()
 {
     const fs::path path = by_age_.begin()->second;
-    const kept file = files_[path];
     std::error_code error;
-    if (file.writer != nullptr)
-        file.writer->close();
+    if (kept_file *const writer = files_[path].writer; writer != nullptr)
+        writer->close();
     fs::remove(path, error);
-    by_age_.erase(by_age_.begin());
-    files_.erase(path);
-    total_ -= file.size;
+    forget(path);
+}
+
+/* Compresses one of the files that nothing will be added to, beside all else. */
+void log_store::compress_next()
+{
+    if (compressing_ || !home.options.compress || server_clock::now() < looked_ + kCompressLook)
+        return;
+    looked_ = server_clock::now();
+    const std::string today = '-' + utc_text("%Y-%m-%d");
+    const auto ready = std::ranges::find_if(files_, [&](const auto &entry) {
+        const std::string name = entry.first.filename();
+        return entry.second.writer == nullptr && (name.ends_with(".log") || name.ends_with(".bin")) &&
+               (entry.second.size >= home.options.rotate_size || name.find(today) == name.npos);
+    });
+    if (ready == files_.end())
+        return;
+    compressing_ = true;
+    asio::post(compressor_, [this, path = ready->first] {
+        std::string why;
+        compress_file(path, why);
+        asio::post(home.io, [this, path, why] { compressed(path, why); });
+    });
+}
+
+void log_store::compressed(const fs::path &path, const std::string &why)
+{
+    compressing_ = false;
+    const fs::path made = path.string() + kCompressedSuffix;
+    const auto entry = files_.find(path);
+    std::error_code error;
+    if (!why.empty())
+        server_log("not compressed", {{"file", path}, {"why", why}});
+    else if (entry == files_.end())
+        fs::remove(made, error); /* there was no room for it meanwhile */
+    else {
+        const kept file{fs::file_size(made, error), entry->second.time, nullptr};
+        fs::remove(path, error);
+        forget(path);
+        files_[made] = file;
+        by_age_.emplace(file.time, made);
+        total_ += file.size;
+        looked_ = {};
+    }
 }
 
 /* When a log was written to last; 0 when nothing of it is kept. */

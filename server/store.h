@@ -8,6 +8,7 @@
 #include "server/live_log.h"
 #include "server/server.h"
 
+#include <asio/thread_pool.hpp>
 #include <filesystem>
 #include <map>
 #include <memory>
@@ -18,7 +19,8 @@
 
 class log_store;
 
-/* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ... */
+/* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ...; those before it may have been
+ * compressed. */
 class kept_file
 {
 public:
@@ -106,6 +108,9 @@ private:
     void closed(const std::filesystem::path &path);
     void make_room(std::uint64_t bytes);
     void remove_oldest();
+    void forget(const std::filesystem::path &path);
+    void compress_next();
+    void compressed(const std::filesystem::path &path, const std::string &why);
     std::time_t last_write(const std::string &imei, log_kind kind) const;
 
     const std::filesystem::path folder_;
@@ -113,6 +118,9 @@ private:
     std::set<std::pair<std::filesystem::file_time_type, std::filesystem::path>> by_age_;
     std::set<kept_file *> waiting_; /* with bytes to write */
     std::uint64_t total_ = 0;
+    asio::thread_pool compressor_{1};
+    bool compressing_ = false;
+    server_clock::time_point looked_{}; /* for something to compress */
     std::unique_ptr<kept_file> events_;
     std::map<std::pair<std::string, log_kind>, std::shared_ptr<stored_log>> logs_;
 };

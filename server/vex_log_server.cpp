@@ -67,6 +67,7 @@ void add_store_options(CLI::App &app, server_options &options)
         ->transform(bytes)
         ->capture_default_str();
     app.add_option("--store-days", options.store_days, "days that a file is kept");
+    app.add_flag("--compress", options.compress, "compress the files that are followed by others, with zstd");
     app.add_option("--rotate", options.rotate_size, "size at which a file is followed by the next")
         ->transform(bytes)
         ->capture_default_str();

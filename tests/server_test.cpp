@@ -447,6 +447,11 @@ TEST_F(LogServer, KeepsNoMoreThanThereIsRoomFor)
     EXPECT_GT(200001, std::stol(run_command("cat $(find /tmp/st -type f) | wc -c")));
     EXPECT_NE("1\n", run_command("ls /tmp/st/1111 | wc -l"));
     end();
+    const std::string all = run_command("cat /tmp/st/1111/* | sort");
+    start("--plain --store /tmp/st --rotate 60KB --compress");
+    awaits("[ $(ls /tmp/st/1111/*.log | wc -l) = 1 ]"); /* to which more may come today */
+    EXPECT_EQ(all, run_command("(zstd -dcq /tmp/st/1111/*.zst; cat /tmp/st/1111/*.log) | sort"));
+    end();
 
     run_command("head -c 1000000 /dev/zero >/tmp/st/old/full 2>/dev/null"); /* no room, for somebody else's fault */
     start("--plain --store /tmp/st --stream syslog --store-limit 1GB --metrics 127.0.0.1:9100");
