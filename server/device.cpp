@@ -114,6 +114,10 @@ task<void> device::take_reply(const frame_view &frame)
     }
     command->reply = frame.control;
     const bool last = is_last(*command, frame);
+    if (command->kept)
+        command->kept->append(frame.data);
+    if (command->kept && last && message(command->reply).text("Result") == "Success")
+        command->kept->finish();
     const auto tool = command->tool;
     if (tool != nullptr) {
         const bool sent = co_await tool->send(frame.bytes);

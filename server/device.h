@@ -7,6 +7,7 @@
 #include "server/frame_link.h"
 #include "server/live_log.h"
 #include "server/server.h"
+#include "server/stored_archive.h"
 
 #include <array>
 #include <list>
@@ -27,9 +28,10 @@ struct device_command {
 
     wake_up done; /* all of its answer has come */
     const std::string msgid;
-    std::shared_ptr<frame_link> tool; /* gets the answer; none when nobody does, or nobody any more */
-    std::string reply;                /* the newest frame's control text */
-    std::uint64_t archived = 0;       /* bytes of an archive that have come */
+    std::shared_ptr<frame_link> tool;     /* gets the answer; none when nobody does, or nobody any more */
+    std::string reply;                    /* the newest frame's control text */
+    std::uint64_t archived = 0;           /* bytes of an archive that have come */
+    std::unique_ptr<stored_archive> kept; /* which is kept, too */
 };
 
 class device : public std::enable_shared_from_this<device>

@@ -22,6 +22,14 @@ struct kind_names {
 };
 constexpr kind_names kNames[kLogKinds] = {{"syslog", "syslog_connect"}, {"qxdm", "modemlog_connect"}};
 
+std::uint64_t lines_in(std::string_view bytes)
+{
+    std::uint64_t lines = 0;
+    for (std::size_t at = 0; (at = bytes.find('\n', at)) != bytes.npos; ++at)
+        ++lines;
+    return lines;
+}
+
 /* Tells a tool that its log has ended, as it wanted or else why. */
 std::string last_frame(const std::string &why)
 {
@@ -275,6 +283,8 @@ task<void> live_log::relay()
         if (bytes.empty())
             co_return;
         device->home.metrics.log_bytes += bytes.size();
+        if (kind_ == log_kind::syslog)
+            device->home.metrics.log_lines += lines_in(bytes);
         for (const auto &follower : followers_)
             follower->push(bytes);
         if (stored_)

@@ -47,6 +47,7 @@ std::string text_of(const server &server)
     one("command_seconds_total", "counter", "Time that they took.", counts.command_seconds);
     one("commands_failed_total", "counter", "Commands without success.", static_cast<double>(counts.commands_failed));
     one("log_bytes_total", "counter", "Bytes of live logs.", static_cast<double>(counts.log_bytes));
+    one("log_lines_total", "counter", "Lines of live system logs.", static_cast<double>(counts.log_lines));
     one("log_gaps_total", "counter", "Gaps in kept logs.", static_cast<double>(counts.log_gaps));
     one("store_lost_bytes_total", "counter", "Bytes that found no room.", static_cast<double>(counts.store_bytes_lost));
     if (server.store)

@@ -18,6 +18,7 @@ struct server_metrics {
     double command_seconds = 0;
     std::uint64_t commands_failed = 0;
     std::uint64_t log_bytes = 0;
+    std::uint64_t log_lines = 0; /* of system logs */
     std::uint64_t log_gaps = 0;
     std::uint64_t store_bytes_lost = 0;
 };

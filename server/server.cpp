@@ -47,13 +47,8 @@ void server_event(server &server, const char *what, std::initializer_list<std::p
     server_log(what, members);
     if (!server.store)
         return;
-    char time[32];
-    const std::time_t now = std::time(nullptr);
-    std::tm utc{};
-    gmtime_r(&now, &utc);
-    std::strftime(time, sizeof time, "%Y-%m-%dT%H:%M:%SZ", &utc);
     const json_tree root{cJSON_CreateObject()};
-    cJSON_AddStringToObject(root.get(), "time", time);
+    cJSON_AddStringToObject(root.get(), "time", utc_text("%Y-%m-%dT%H:%M:%SZ").c_str());
     cJSON_AddStringToObject(root.get(), "event", what);
     for (const auto &[name, value] : members)
         cJSON_AddStringToObject(root.get(), name, value.c_str());

@@ -1,6 +1,7 @@
 #include "server/store.h"
 
 #include "server/compress.h"
+#include "server/stored_archive.h"
 
 #include <algorithm>
 #include <asio/post.hpp>
@@ -21,16 +22,6 @@ constexpr auto kCompressLook = 60s; /* from one look for something to compress t
 constexpr std::size_t kFlushAt = 65536;
 constexpr std::size_t kLineMax = 8192; /* a longer line is broken */
 
-std::string utc_text(const char *format)
-{
-    char text[32];
-    const std::time_t now = std::time(nullptr);
-    std::tm utc{};
-    gmtime_r(&now, &utc);
-    std::strftime(text, sizeof text, format, &utc);
-    return text;
-}
-
 std::time_t to_time(fs::file_time_type time)
 {
     return std::chrono::system_clock::to_time_t(
@@ -48,6 +39,16 @@ std::string stamp()
 }
 
 } // namespace
+
+std::string utc_text(const char *format)
+{
+    char text[32];
+    const std::time_t now = std::time(nullptr);
+    std::tm utc{};
+    gmtime_r(&now, &utc);
+    std::strftime(text, sizeof text, format, &utc);
+    return text;
+}
 
 kept_file::kept_file(log_store &store, fs::path folder, std::string name, std::string suffix)
     : store_(store), folder_(std::move(folder)), name_(std::move(name)), suffix_(std::move(suffix))
@@ -228,10 +229,10 @@ void log_store::scan()
     for (fs::recursive_directory_iterator at(folder_, error), end; at != end; at.increment(error)) {
         if (error || !at->is_regular_file(error))
             continue;
-        const kept file{at->file_size(error), at->last_write_time(error), nullptr};
-        files_[at->path()] = file;
-        by_age_.emplace(file.time, at->path());
-        total_ += file.size;
+        if (at->path().extension() == kPartSuffix) /* of a server that was killed */
+            fs::remove(at->path(), error);
+        else
+            enter(at->path(), at->file_size(error), at->last_write_time(error));
     }
     make_room(0);
 }
@@ -269,7 +270,6 @@ void log_store::closed(const fs::path &path)
         entry->second.writer = nullptr;
 }
 
-/* Removes what is too old, or has to go for so many bytes more. */
 void log_store::make_room(std::uint64_t bytes)
 {
     const auto oldest = [this](unsigned days) {
@@ -277,6 +277,20 @@ void log_store::make_room(std::uint64_t bytes)
     };
     while (!by_age_.empty() && (total_ + bytes > home.options.store_limit || oldest(home.options.store_days)))
         remove_oldest();
+}
+
+void log_store::add(const fs::path &path, std::uint64_t size)
+{
+    enter(path, size, fs::file_time_type::clock::now());
+}
+
+/* Takes a file that is there, and written to no more, into the books. */
+void log_store::enter(const fs::path &path, std::uint64_t size, fs::file_time_type time)
+{
+    forget(path);
+    files_[path] = {size, time, nullptr};
+    by_age_.emplace(time, path);
+    total_ += size;
 }
 
 /* Takes a file that is no more off the books. */
@@ -333,12 +347,9 @@ void log_store::compressed(const fs::path &path, const std::string &why)
     else if (entry == files_.end())
         fs::remove(made, error); /* there was no room for it meanwhile */
     else {
-        const kept file{fs::file_size(made, error), entry->second.time, nullptr};
+        enter(made, fs::file_size(made, error), entry->second.time);
         fs::remove(path, error);
         forget(path);
-        files_[made] = file;
-        by_age_.emplace(file.time, made);
-        total_ += file.size;
         looked_ = {};
     }
 }

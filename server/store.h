@@ -19,6 +19,9 @@
 
 class log_store;
 
+/* The time as strftime() writes it, in UTC. */
+std::string utc_text(const char *format);
+
 /* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ...; those before it may have been
  * compressed. */
 class kept_file
@@ -90,6 +93,11 @@ public:
     void event(const std::string &line);
     std::uint64_t total() const { return total_; }
 
+    /* Removes what is too old, or has to go for so many bytes more. */
+    void make_room(std::uint64_t bytes);
+    /* Takes a finished file into account. */
+    void add(const std::filesystem::path &path, std::uint64_t size);
+
     server &home;
 
 private:
@@ -106,8 +114,8 @@ private:
     task<void> tick();
     void grew(const std::filesystem::path &path, std::uint64_t bytes, kept_file *writer);
     void closed(const std::filesystem::path &path);
-    void make_room(std::uint64_t bytes);
     void remove_oldest();
+    void enter(const std::filesystem::path &path, std::uint64_t size, std::filesystem::file_time_type time);
     void forget(const std::filesystem::path &path);
     void compress_next();
     void compressed(const std::filesystem::path &path, const std::string &why);

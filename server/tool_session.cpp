@@ -181,8 +181,8 @@ task<std::shared_ptr<device>> find_device(tool_session &tool, const message &req
     co_return found;
 }
 
-/* Has the tool's commands carried out until it leaves. */
-task<void> run_commands(tool_session &tool, device &device)
+/* Has the tool's commands carried out until it leaves; its archives are kept, if it wants that. */
+task<void> run_commands(tool_session &tool, device &device, bool keep)
 {
     for (;;) {
         tool.link->limit(kIdleMax);
@@ -191,6 +191,8 @@ task<void> run_commands(tool_session &tool, device &device)
             co_return;
         tool.link->unlimited();
         const auto command = std::make_shared<device_command>(tool.home.io, message(frame->control).msgid(), tool.link);
+        if (keep && command->msgid == "2")
+            command->kept = std::make_unique<stored_archive>(*tool.home.store, device.about.imei);
         const bool answered = co_await device.run(command, frame->bytes);
         if (!answered) {
             if (device.link->ended())
@@ -203,6 +205,11 @@ task<void> run_commands(tool_session &tool, device &device)
 /* Gives a tool the device that it names, for as long as it stays. */
 task<void> give_device(tool_session &tool, const message &request)
 {
+    const bool keep = request.text("store") == "1";
+    if (keep && !tool.home.store) {
+        co_await fail(tool, "device", "it keeps nothing: it was started without --store");
+        co_return;
+    }
     const std::shared_ptr<device> device = co_await find_device(tool, request);
     if (!device)
         co_return;
@@ -216,7 +223,7 @@ task<void> give_device(tool_session &tool, const message &request)
     }
     const bool told = co_await hand_over(tool, *device);
     if (told)
-        co_await run_commands(tool, *device);
+        co_await run_commands(tool, *device, keep);
     device->give_turn();
 }
 

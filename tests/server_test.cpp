@@ -157,12 +157,12 @@ TEST_F(LogServer, PassesEveryCommandOn)
     for (const auto &[tls_off, options, address] :
          {std::tuple{"1", std::string("--plain"), "127.0.0.1"}, {"0", kTls, "::1"}, {"", kTls, "localhost"}}) {
         set_nv("log_use_ssl_disable", tls_off);
-        start(options);
+        start(options + " --store /tmp/st");
         daemon_process daemon({"-a", address, "-p", "5000x", "-r", "3"});
         for (const auto &[command, words] :
              {std::pair{"--wait 20 version", "IMEI              356938035643809\n"},
               {"bsp usb err", "usb: log level err: the device was"},
-              {"archive /tmp/a.tgz", "Log archive stored as"},
+              {"archive --store /tmp/a.tgz", "Log archive stored as"},
               {"modem", "set to: online\n"},
               {"--json modem", R"({"msgid":"11","mode_lpm_online":"online","Result":"Success"})"},
               {"config /tmp/p.tar", "taken the package of 10240 bytes"},
@@ -172,6 +172,7 @@ TEST_F(LogServer, PassesEveryCommandOn)
             EXPECT_NE(std::string::npos, said.find("= 0\n")) << said;
         }
         EXPECT_EQ("", run_command("tar -xOzf /tmp/a.tgz logfs/noise | cmp - /logfs/noise"));
+        EXPECT_EQ("", run_command("cmp /tmp/st/*/archive-*.tgz /tmp/a.tgz; rm -r /tmp/st"));
         EXPECT_EQ("DIAG", run_command("head -c 4 /tmp/modem.log; rm /tmp/modem.log"));
         expect_all(tool("devices"), {kImei, "VX-520", "VX52021A00417", " 6 Success\n= 0\n"});
         end();

@@ -18,9 +18,12 @@ namespace
 std::optional<tool_link> reach_through_server(const tool_device &device, std::string &why)
 {
     tool_frame answer;
-    std::optional<tool_link> link = tool_ask_server(
-        device.server, device.limits,
-        {{"msgid", "device"}, {"imei", device.imei}, {"wait", std::to_string(device.server.wait.count())}}, answer, why);
+    std::optional<tool_link> link = tool_ask_server(device.server, device.limits,
+                                                    {{"msgid", "device"},
+                                                     {"imei", device.imei},
+                                                     {"wait", std::to_string(device.server.wait.count())},
+                                                     {"store", device.server.store ? "1" : "0"}},
+                                                    answer, why);
     if (!link)
         return std::nullopt;
     link->with_device = true;
@@ -67,7 +70,10 @@ std::optional<tool_answer> tool_exchange(tool_device &device, const std::string 
 
 std::string tool_said(const tool_device &device, const tool_answer &answer)
 {
-    return (device.link ? device.link->where : tool_has_server(device) ? device.imei : device.host + " port " + device.port) + ' ' + answer.reason;
+    return (device.link               ? device.link->where
+            : tool_has_server(device) ? device.imei
+                                      : device.host + " port " + device.port) +
+           ' ' + answer.reason;
 }
 
 std::optional<tool_answer> tool_ask(tool_device &device, const std::string &command, int &status)

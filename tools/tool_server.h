@@ -14,6 +14,7 @@ struct tool_server {
     std::string address;       /* a unix socket's path, or ADDRESS:PORT; empty: devices are connected to directly */
     std::string cert, key, ca; /* PEM files: an operator's certificate, its key, and what the server's is signed by */
     std::chrono::seconds wait{0}; /* for a device that is not there */
+    bool store = false;           /* keep archives there, too */
 };
 
 /* What a server may be asked first, on a connection of its own. */

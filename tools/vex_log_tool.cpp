@@ -150,8 +150,11 @@ void add_server_options(CLI::App &app, tool_device &device, tool_choice &choice)
                    "the log server that the device has called: a unix socket's path, or ADDRESS:PORT")
         ->envname("VEX_LOG_SERVER")
         ->type_name("ADDRESS");
-    CLI::Option *const all = app.add_flag("--all", choice.all, "all devices that are connected to the server")->excludes(host);
-    app.add_option("--device", choice.imeis, "IMEI of the device; may be given several times")->excludes(host)->excludes(all);
+    CLI::Option *const all =
+        app.add_flag("--all", choice.all, "all devices that are connected to the server")->excludes(host);
+    app.add_option("--device", choice.imeis, "IMEI of the device; may be given several times")
+        ->excludes(host)
+        ->excludes(all);
     app.add_option("--parallel", choice.parallel, "how many devices at a time")
         ->check(CLI::Range(1, 256))
         ->capture_default_str();
@@ -164,6 +167,7 @@ void add_server_options(CLI::App &app, tool_device &device, tool_choice &choice)
                                            {"--key", &server.key, "its key"},
                                            {"--ca", &server.ca, "certificate that the server's is signed by"}})
         app.add_option(name, *file, help)->check(CLI::ExistingFile);
+    app.get_subcommand("archive")->add_flag("--store", server.store, "keep it on the log server, too");
     CLI::App *const devices = app.add_subcommand("devices", "list the devices that are connected to the log server");
     devices->add_flag("--watch", choice.watch, "and go on with who calls and who leaves");
     devices->callback([&choice] { choice.list = true; });
