@@ -131,7 +131,7 @@ task<void> log_follower::pass_on()
 }
 
 live_log::live_log(device &device, log_kind kind)
-    : device_(device.weak_from_this()), io_(device.home.io), kind_(kind), called_(io_)
+    : device_(device.weak_from_this()), io_(device.home.io), kind_(kind), called_(io_), left_(io_)
 {
 }
 
@@ -189,6 +189,7 @@ void live_log::device_left()
     if (link_)
         link_->end("the device has hung up");
     called_.set();
+    left_.set();
 }
 
 void live_log::tell_started(const std::string &reply)
@@ -199,7 +200,7 @@ void live_log::tell_started(const std::string &reply)
         follower->started.set();
     }
     if (stored_)
-        stored_->resumed();
+        stored_->resumed(this);
 }
 
 /* Ends those who follow; or only those who followed a log that had begun, as the others wait for the next one. */
@@ -212,7 +213,7 @@ void live_log::tell_ended(const std::string &why, bool to_all)
         (*follower)->end((*follower)->wanted ? why : "");
     followers_.erase(followers_.begin(), staying);
     if (stored_)
-        stored_->interrupted(why);
+        stored_->interrupted(this, why);
 }
 
 /* Runs the log for as long as somebody wants it. */
@@ -234,9 +235,7 @@ task<void> live_log::run()
         stopping_ = false;
         tell_ended(why, !begun);
         if (wanted()) {
-            asio::steady_timer timer(io_, pause);
-            asio::error_code cancelled;
-            co_await timer.async_wait(await_into(cancelled));
+            co_await left_.wait(server_clock::now() + pause);
         }
     }
     running_ = false;

@@ -88,6 +88,7 @@ private:
     std::shared_ptr<frame_link> link_;   /* the data link */
     std::string reply_;                  /* to the start that it comes from */
     wake_up called_;                     /* the data link has come */
+    wake_up left_;                       /* the device */
     bool running_ = false;
     bool expecting_ = false; /* the data link */
     bool stopping_ = false;  /* the device was told to end the log that link_ brings */

@@ -178,10 +178,11 @@ void stored_log::tell_lost()
     tell(std::to_string(lost) + " bytes are missing: " + file_.why_lost());
 }
 
-void stored_log::interrupted(const std::string &why)
+void stored_log::interrupted(const live_log *source, const std::string &why)
 {
-    if (since_ != 0)
+    if (source != source_)
         return;
+    source_ = nullptr;
     since_ = std::time(nullptr);
     why_ = why;
     if (!line_.empty()) {
@@ -192,8 +193,9 @@ void stored_log::interrupted(const std::string &why)
     file_.close(); /* it may be for good */
 }
 
-void stored_log::resumed()
+void stored_log::resumed(const live_log *source)
 {
+    source_ = source;
     if (since_ != 0)
         tell("nothing came for " + std::to_string(std::time(nullptr) - since_) + " s: " + why_);
     since_ = 0;

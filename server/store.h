@@ -64,9 +64,10 @@ public:
     stored_log(log_store &store, const std::string &imei, log_kind kind, std::time_t last);
 
     void append(std::string_view bytes);
-    /* The log has ended; it has begun again. What is missing in between is told. */
-    void interrupted(const std::string &why);
-    void resumed();
+    /* The log has begun again, from that source; it has ended, unless another source has begun meanwhile. What is missing
+     * in between is told. */
+    void resumed(const live_log *source);
+    void interrupted(const live_log *source, const std::string &why);
 
 private:
     void append_lines(std::string_view bytes);
@@ -77,8 +78,9 @@ private:
     const std::string imei_;
     const log_kind kind_;
     kept_file file_;
-    std::string line_;  /* that is not whole yet, with its time */
-    std::time_t since_; /* of an interruption; 0: there is none */
+    std::string line_;                 /* that is not whole yet, with its time */
+    const live_log *source_ = nullptr; /* that brings it now */
+    std::time_t since_;                /* of an interruption; 0: there is none */
     std::string why_ = "the server was not there";
 };
 
