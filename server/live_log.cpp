@@ -33,7 +33,7 @@ std::uint64_t lines_in(std::string_view bytes)
 /* Tells a tool that its log has ended, as it wanted or else why. */
 std::string last_frame(const std::string &why)
 {
-    return make_frame(json_line({{"msgid", "stream"}, {"Result", why.empty() ? "Success" : "Fail:" + why}}));
+    return make_frame(tool_json({{"msgid", "stream"}, {"Result", why.empty() ? "Success" : "Fail:" + why}}));
 }
 
 /* The request by which a log begins or ends, and the confirmation of its data link. */
@@ -87,7 +87,7 @@ void log_follower::push(std::string_view bytes)
         return;
     }
     if (missed_ > 0) {
-        queue_.push_back(make_frame(json_line({{"msgid", "stream"}, {"missed", std::to_string(missed_)}})));
+        queue_.push_back(make_frame(tool_json({{"msgid", "stream"}, {"missed", std::to_string(missed_)}})));
         missed_ = 0;
     }
     while (!bytes.empty()) {

@@ -5,10 +5,8 @@
 #include "protocol/json_tree.h"
 #include "tools/tool_answer.h"
 
-#include <initializer_list>
 #include <string>
 #include <string_view>
-#include <utility>
 
 /* A control text that was received. */
 class message
@@ -33,8 +31,5 @@ private:
 
     json_tree root_;
 };
-
-/* A JSON object of texts, on one line. */
-std::string json_line(std::initializer_list<std::pair<const char *, std::string>> members);
 
 #endif

@@ -34,7 +34,7 @@ server::server(asio::io_context &context, const server_options &chosen)
 
 server::~server() = default;
 
-void server_log(const char *what, std::initializer_list<std::pair<const char *, std::string>> members)
+void server_log(const char *what, const tool_members &members)
 {
     std::string line = what;
     for (const auto &[name, value] : members)
@@ -42,17 +42,12 @@ void server_log(const char *what, std::initializer_list<std::pair<const char *, 
     write_line(line + '\n');
 }
 
-void server_event(server &server, const char *what, std::initializer_list<std::pair<const char *, std::string>> members)
+void server_event(server &server, const char *what, const tool_members &members)
 {
     server_log(what, members);
     if (!server.store)
         return;
-    const json_tree root{cJSON_CreateObject()};
-    cJSON_AddStringToObject(root.get(), "time", utc_text("%Y-%m-%dT%H:%M:%SZ").c_str());
-    cJSON_AddStringToObject(root.get(), "event", what);
-    for (const auto &[name, value] : members)
-        cJSON_AddStringToObject(root.get(), name, value.c_str());
-    char *const printed = cJSON_PrintUnformatted(root.get());
-    server.store->event(printed != nullptr ? printed : "");
-    cJSON_free(printed);
+    tool_members all{{"time", utc_text("%Y-%m-%dT%H:%M:%SZ")}, {"event", what}};
+    all.insert(all.end(), members.begin(), members.end());
+    server.store->event(tool_json(all));
 }

@@ -7,7 +7,6 @@
 #include "server/metrics.h"
 #include "server/server_tls.h"
 
-#include <initializer_list>
 #include <memory>
 #include <string>
 #include <vector>
@@ -59,10 +58,9 @@ struct server {
 extern int server_log_fd; /* standard error, unless set otherwise */
 
 /* Such a line: what happened, to whom. */
-void server_log(const char *what, std::initializer_list<std::pair<const char *, std::string>> members);
+void server_log(const char *what, const tool_members &members);
 
 /* The same, kept with the store's events, too. */
-void server_event(server &server, const char *what,
-                  std::initializer_list<std::pair<const char *, std::string>> members);
+void server_event(server &server, const char *what, const tool_members &members);
 
 #endif

@@ -34,13 +34,13 @@ task<bool> say(tool_session &tool, std::string frame)
 
 task<bool> fail(tool_session &tool, std::string msgid, std::string why)
 {
-    return say(tool, make_frame(json_line({{"msgid", msgid}, {"Result", "Fail:" + why}})));
+    return say(tool, make_frame(tool_json({{"msgid", msgid}, {"Result", "Fail:" + why}})));
 }
 
 /* Tells a tool that waits what it waits for. */
 task<bool> let_wait(tool_session &tool, std::string msgid, std::string reason)
 {
-    return say(tool, make_frame(json_line({{"msgid", msgid}, {"Result", "Waiting"}, {"reason", reason}})));
+    return say(tool, make_frame(tool_json({{"msgid", msgid}, {"Result", "Waiting"}, {"reason", reason}})));
 }
 
 /* Tells a tool that it has the device now. */
@@ -48,7 +48,7 @@ task<bool> hand_over(tool_session &tool, const device &device)
 {
     return say(
         tool,
-        make_frame(json_line(
+        make_frame(tool_json(
             {{"msgid", "device"}, {"Result", "Success"}, {"imei", device.about.imei}, {"address", device.address}})));
 }
 
@@ -79,7 +79,7 @@ std::string streams_of(device &device)
 /* What the server tells of a device. */
 std::string describe(device &device, const char *event)
 {
-    return json_line({{"event", event},
+    return tool_json({{"event", event},
                       {"imei", device.about.imei},
                       {"model", device.about.model},
                       {"software", device.about.software},

@@ -32,6 +32,20 @@ std::string member(const cJSON *root, const char *name)
     return text != nullptr ? text : "";
 }
 
+void add_members(cJSON *object, const tool_members &members)
+{
+    for (const auto &[name, value] : members)
+        cJSON_AddStringToObject(object, name, value.c_str());
+}
+
+std::string print(const cJSON *root)
+{
+    char *const printed = cJSON_PrintUnformatted(root);
+    std::string text = printed != nullptr ? printed : "";
+    cJSON_free(printed);
+    return text;
+}
+
 } // namespace
 
 std::string tool_printable(const std::string &text)
@@ -64,18 +78,19 @@ std::string tool_printable_lines(const std::string &text)
     return out;
 }
 
-std::string tool_command(const char *msgid, const char *group,
-                         std::initializer_list<std::pair<const char *, std::string>> members)
+std::string tool_json(const tool_members &members)
+{
+    const json_tree root{cJSON_CreateObject()};
+    add_members(root.get(), members);
+    return print(root.get());
+}
+
+std::string tool_command(const char *msgid, const char *group, const tool_members &members)
 {
     const json_tree root{cJSON_CreateObject()};
     cJSON_AddStringToObject(root.get(), "msgid", msgid);
-    cJSON *const object = group != nullptr ? cJSON_AddObjectToObject(root.get(), group) : root.get();
-    for (const auto &[name, value] : members)
-        cJSON_AddStringToObject(object, name, value.c_str());
-    char *const printed = cJSON_PrintUnformatted(root.get());
-    std::string text = printed != nullptr ? printed : "";
-    cJSON_free(printed);
-    return text;
+    add_members(group != nullptr ? cJSON_AddObjectToObject(root.get(), group) : root.get(), members);
+    return print(root.get());
 }
 
 std::string tool_msgid(const std::string &control)

@@ -4,9 +4,9 @@
 
 #include "protocol/json_tree.h"
 
-#include <initializer_list>
 #include <string>
 #include <utility>
+#include <vector>
 
 enum class tool_verdict {
     success, /* the device said "Success" */
@@ -28,9 +28,12 @@ std::string tool_printable(const std::string &text);
 /* The same for a text of several lines, whose ends are kept. */
 std::string tool_printable_lines(const std::string &text);
 
+/* Members of a JSON object that are texts, and such an object on one line. */
+using tool_members = std::vector<std::pair<const char *, std::string>>;
+std::string tool_json(const tool_members &members);
+
 /* The control text of a command: `members` inside the object `group`, or beside "msgid" where that is null. */
-std::string tool_command(const char *msgid, const char *group,
-                         std::initializer_list<std::pair<const char *, std::string>> members);
+std::string tool_command(const char *msgid, const char *group, const tool_members &members);
 
 /* The message id of a command or a reply; empty when it has none. */
 std::string tool_msgid(const std::string &control);

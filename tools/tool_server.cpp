@@ -54,17 +54,6 @@ std::optional<tool_link> connect_remote(const tool_server &server, const tool_li
     return std::nullopt;
 }
 
-std::string request_text(const tool_members &request)
-{
-    const json_tree root{cJSON_CreateObject()};
-    for (const auto &[name, value] : request)
-        cJSON_AddStringToObject(root.get(), name, value.c_str());
-    char *const printed = cJSON_PrintUnformatted(root.get());
-    std::string text = printed != nullptr ? printed : "";
-    cJSON_free(printed);
-    return text;
-}
-
 std::string text_of(const cJSON *root, const char *name)
 {
     const char *const text = cJSON_GetStringValue(cJSON_GetObjectItem(root, name));
@@ -95,7 +84,7 @@ void show(tool_entry &entry, bool json)
         tool_members members;
         for (const auto &[name, value] : entry)
             members.emplace_back(name.c_str(), value);
-        std::printf("%s\n", request_text(members).c_str());
+        std::printf("%s\n", tool_json(members).c_str());
         return;
     }
     if (entry["event"] != "there")
@@ -113,7 +102,7 @@ std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_l
     std::optional<tool_link> link = server.address.find('/') != std::string::npos
                                         ? connect_local(server.address, limits, why)
                                         : connect_remote(server, limits, why);
-    if (!link || !tool_send(*link, request_text(request), {}, why))
+    if (!link || !tool_send(*link, tool_json(request), {}, why))
         return std::nullopt;
     for (;;) {
         const std::optional<tool_frame> frame = tool_receive(*link, limits.reply + server.wait, why);

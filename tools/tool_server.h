@@ -2,6 +2,7 @@
 #ifndef TOOLS_TOOL_SERVER_H
 #define TOOLS_TOOL_SERVER_H
 
+#include "tools/tool_answer.h"
 #include "tools/tool_link.h"
 
 #include <functional>
@@ -17,10 +18,7 @@ struct tool_server {
     bool store = false;           /* keep archives there, too */
 };
 
-/* What a server may be asked first, on a connection of its own. */
-using tool_members = std::vector<std::pair<const char *, std::string>>;
-
-/* Connects and asks for something. The link on which it comes, and the server's answer; none, and why, when it is not
+/* Connects and asks for something, with `request` as the control text's members. The link on which it comes, and the server's answer; none, and why, when it is not
  * to be had. What is waited for meanwhile is said on standard error. */
 std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_limits &limits,
                                          const tool_members &request, tool_frame &answer, std::string &why);
