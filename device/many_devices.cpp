@@ -4,6 +4,7 @@
  */
 #include "server/frame_link.h"
 #include "server/message.h"
+#include "tools/tls_context.h"
 
 #include <CLI/CLI.hpp>
 #include <asio/ip/tcp.hpp>
@@ -31,10 +32,6 @@ struct fleet_options {
     bool raw = false;                          /* send syslog lines and nothing else */
 };
 
-struct ssl_context_free {
-    void operator()(SSL_CTX *context) const { SSL_CTX_free(context); }
-};
-
 /* What all devices have in common. */
 struct many_devices {
     explicit many_devices(const fleet_options &given) : options(given)
@@ -54,7 +51,7 @@ struct many_devices {
 
     asio::io_context io{1};
     const fleet_options &options;
-    std::unique_ptr<SSL_CTX, ssl_context_free> tls;
+    tls_context tls;
     std::mt19937 chance{1};
     unsigned next = 0;
     unsigned connected = 0;

@@ -8,8 +8,8 @@
 /* What a compressed file has behind its name. */
 constexpr char kCompressedSuffix[] = ".zst";
 
-/* Makes a compressed file beside the file, as old as that. False, and why, when that can't be had; then there is none. Takes
- * its time: may be called by any thread. */
+/* Makes a compressed file beside the file, as old as that. False, and why, when that can't be had; then there is none.
+ * Takes its time: may be called by any thread. */
 bool compress_file(const std::filesystem::path &path, std::string &why);
 
 #endif

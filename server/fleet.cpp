@@ -154,8 +154,8 @@ task<std::string> fleet::serve_device(std::shared_ptr<frame_link> link, const me
     co_return "";
 }
 
-/* Whether a caller may take over from a device of the same IMEI, if there is one: when it proves to be the same one, or when
- * the older one turns out to be gone. */
+/* Whether a caller may take over from a device of the same IMEI, if there is one: when it proves to be the same one, or
+ * when the older one turns out to be gone. */
 task<bool> fleet::may_replace(std::shared_ptr<device> older, const std::string &identity)
 {
     if (older == nullptr || older->identity == identity)

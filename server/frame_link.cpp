@@ -1,11 +1,12 @@
 #include "server/frame_link.h"
 
+#include "tools/tls_context.h"
+
 #include <algorithm>
 #include <array>
 #include <asio/post.hpp>
 #include <cstring>
 #include <netdb.h>
-#include <openssl/err.h>
 
 namespace
 {
@@ -30,14 +31,6 @@ bool may_be_frame(std::span<const unsigned char> held, const log_pkg_header &hea
     return std::equal(held.begin(), held.begin() + static_cast<std::ptrdiff_t>(std::min(held.size(), kPkgTagLen)),
                       PKG_HEAD) &&
            header.control_len <= kPkgControlMax && header.data_len <= kPkgDataMax;
-}
-
-std::string tls_error()
-{
-    const char *const reason = ERR_reason_error_string(ERR_peek_last_error());
-    std::string text = reason != nullptr ? reason : "hung up";
-    ERR_clear_error();
-    return text;
 }
 
 } // namespace
@@ -95,7 +88,7 @@ task<bool> frame_link::shake_hands()
             const long verified = SSL_get_verify_result(session_.get());
             end(verified != X509_V_OK
                     ? std::string("its certificate is not accepted: ") + X509_verify_cert_error_string(verified)
-                    : "no TLS session: " + tls_error());
+                    : "no TLS session: " + tls_last_error("hung up"));
         } else {
             const bool ready = co_await wait_for(error);
             if (!ready)
@@ -116,7 +109,7 @@ ssize_t frame_link::read_some(std::span<unsigned char> into)
         const int error = SSL_get_error(session_.get(), n);
         if (error == SSL_ERROR_WANT_READ || error == SSL_ERROR_WANT_WRITE)
             return -error;
-        end(error == SSL_ERROR_ZERO_RETURN ? "it hung up" : "the TLS session broke: " + tls_error());
+        end(error == SSL_ERROR_ZERO_RETURN ? "it hung up" : "the TLS session broke: " + tls_last_error("hung up"));
         return 0;
     }
     const ssize_t n = recv(socket_.native_handle(), into.data(), into.size(), 0);
@@ -236,7 +229,7 @@ task<bool> frame_link::send(std::span<const unsigned char> bytes)
         if (n > 0)
             bytes = bytes.subspan(static_cast<std::size_t>(n));
         else if (error != SSL_ERROR_WANT_WRITE && error != SSL_ERROR_WANT_READ)
-            end(session_ ? "the TLS session broke: " + tls_error() : std::strerror(errno));
+            end(session_ ? "the TLS session broke: " + tls_last_error("hung up") : std::strerror(errno));
         else {
             end_after(send_timer_, kSendMax, "it takes nothing");
             co_await wait_for(error);

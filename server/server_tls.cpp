@@ -1,18 +1,9 @@
 #include "server/server_tls.h"
 
-#include <openssl/err.h>
 #include <openssl/x509v3.h>
 
 namespace
 {
-
-std::string last_error()
-{
-    const char *const reason = ERR_reason_error_string(ERR_peek_last_error());
-    std::string text = reason != nullptr ? reason : "no reason given";
-    ERR_clear_error();
-    return text;
-}
 
 struct x509_deleter {
     void operator()(X509 *certificate) const { X509_free(certificate); }
@@ -28,9 +19,9 @@ x509 peer_certificate(const SSL *session)
 
 bool tls_endpoint::load(const std::string &cert, const std::string &key, const std::string &ca, std::string &why)
 {
-    std::unique_ptr<SSL_CTX, ssl_context_deleter> context{SSL_CTX_new(TLS_server_method())};
+    tls_context context{SSL_CTX_new(TLS_server_method())};
     if (!context) {
-        why = "cannot begin with TLS: " + last_error();
+        why = "cannot begin with TLS: " + tls_last_error("no reason given");
         return false;
     }
     SSL_CTX_set_verify(context.get(), SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
@@ -54,7 +45,7 @@ bool tls_endpoint::load(const std::string &cert, const std::string &key, const s
         context_ = std::move(context);
         return true;
     }
-    why += ": " + last_error();
+    why += ": " + tls_last_error("no reason given");
     return false;
 }
 

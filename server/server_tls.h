@@ -3,13 +3,10 @@
 #define SERVER_SERVER_TLS_H
 
 #include "server/frame_link.h"
+#include "tools/tls_context.h"
 
 #include <memory>
 #include <string>
-
-struct ssl_context_deleter {
-    void operator()(SSL_CTX *context) const { SSL_CTX_free(context); }
-};
 
 /* One place at which the server is called. */
 class tls_endpoint
@@ -27,7 +24,7 @@ public:
     int days_left() const;
 
 private:
-    std::unique_ptr<SSL_CTX, ssl_context_deleter> context_;
+    tls_context context_;
 };
 
 /* Whom a certificate is for: the common name of the peer's, empty without one. */

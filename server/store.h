@@ -22,8 +22,8 @@ class log_store;
 /* The time as strftime() writes it, in UTC. */
 std::string utc_text(const char *format);
 
-/* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ...; those before it may have been
- * compressed. */
+/* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ...; those before it may have
+ * been compressed. */
 class kept_file
 {
 public:
@@ -56,7 +56,8 @@ private:
     const char *why_lost_ = "";
 };
 
-/* A live log that is kept, over all the links that bring it. Each line of the system log gets the time at which it came. */
+/* A live log that is kept, over all the links that bring it. Each line of the system log gets the time at which it
+ * came. */
 class stored_log
 {
 public:

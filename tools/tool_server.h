@@ -18,8 +18,8 @@ struct tool_server {
     bool store = false;           /* keep archives there, too */
 };
 
-/* Connects and asks for something, with `request` as the control text's members. The link on which it comes, and the server's answer; none, and why, when it is not
- * to be had. What is waited for meanwhile is said on standard error. */
+/* Connects and asks for something, with `request` as the control text's members. The link on which it comes, and the
+ * server's answer; none, and why, when it is not to be had. What is waited for meanwhile is said on standard error. */
 std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_limits &limits,
                                          const tool_members &request, tool_frame &answer, std::string &why);
 

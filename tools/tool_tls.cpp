@@ -7,15 +7,6 @@
 namespace
 {
 
-/* What the library found wrong last. */
-std::string last_error()
-{
-    const char *const reason = ERR_reason_error_string(ERR_peek_last_error());
-    std::string text = reason != nullptr ? reason : "the peer has hung up";
-    ERR_clear_error();
-    return text;
-}
-
 /* Why there is no session with a caller. */
 std::string handshake_error(const SSL *session)
 {
@@ -23,7 +14,7 @@ std::string handshake_error(const SSL *session)
         return std::string("its certificate is not accepted: ") + X509_verify_cert_error_string(verified) +
                ". Is it signed by --ca?";
     const int reason = ERR_GET_REASON(ERR_peek_last_error());
-    std::string text = "TLS handshake failed: " + last_error();
+    std::string text = "TLS handshake failed: " + tls_last_error("the peer has hung up");
     if (reason == SSL_R_WRONG_VERSION_NUMBER || reason == SSL_R_HTTP_REQUEST)
         text += ". It does not seem to speak TLS; one without is served with --plain";
     return text;
@@ -35,7 +26,7 @@ tls_context make_context(const SSL_METHOD *method, const std::string &cert, cons
 {
     tls_context context{SSL_CTX_new(method)};
     if (!context) {
-        why = "cannot begin with TLS: " + last_error();
+        why = "cannot begin with TLS: " + tls_last_error("the peer has hung up");
         return nullptr;
     }
     SSL_CTX_set_verify(context.get(), SSL_VERIFY_PEER | SSL_VERIFY_FAIL_IF_NO_PEER_CERT, nullptr);
@@ -49,7 +40,7 @@ tls_context make_context(const SSL_METHOD *method, const std::string &cert, cons
         why = "cannot use the CA certificate " + ca;
     else
         return context;
-    why += ": " + last_error();
+    why += ": " + tls_last_error("the peer has hung up");
     return nullptr;
 }
 
@@ -57,7 +48,7 @@ tls_context make_context(const SSL_METHOD *method, const std::string &cert, cons
 tls_session shake_hands(tls_session session, int fd, int (*step)(SSL *), tool_clock::time_point end, std::string &why)
 {
     if (!session || SSL_set_fd(session.get(), fd) != 1) {
-        why = "TLS handshake failed: " + last_error();
+        why = "TLS handshake failed: " + tls_last_error("the peer has hung up");
         return nullptr;
     }
     for (;;) {

@@ -2,6 +2,7 @@
 #ifndef TOOLS_TOOL_TLS_H
 #define TOOLS_TOOL_TLS_H
 
+#include "tools/tls_context.h"
 #include "tools/tool_wait.h"
 
 #include <memory>
@@ -9,9 +10,6 @@
 #include <string>
 #include <sys/types.h>
 
-struct tls_context_deleter {
-    void operator()(SSL_CTX *context) const { SSL_CTX_free(context); }
-};
 struct tls_session_deleter {
     void operator()(SSL *session) const
     {
@@ -20,7 +18,6 @@ struct tls_session_deleter {
     }
 };
 
-using tls_context = std::unique_ptr<SSL_CTX, tls_context_deleter>;
 using tls_session = std::unique_ptr<SSL, tls_session_deleter>;
 
 /* A context from PEM files: our certificate and key, and the certificate that the other side's must be signed by. None,

@@ -208,5 +208,7 @@ int main(int argc, char **argv)
     add_server_options(app, device, choice);
 
     CLI11_PARSE(app, argc, argv);
+    if (app.count("--host") > 0)
+        device.server.address.clear(); /* which the environment may name */
     return tool_exit_status(run(device, choice, job));
 }
