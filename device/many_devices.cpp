@@ -22,6 +22,7 @@ using asio::ip::tcp;
 struct fleet_options {
     std::string host = "127.0.0.1";
     std::uint16_t port = 5000;
+    std::uint16_t other_port = 0; /* of another server, for when that one is away; 0: there is none */
     unsigned count = 100;
     std::uint64_t first = 100'000'000'000'000; /* IMEI of the first */
     std::string cert, key;                     /* PEM files; empty: no TLS */
@@ -105,6 +106,7 @@ struct one_device : std::enable_shared_from_this<one_device> {
     const std::string imei;
     std::shared_ptr<frame_link> control;
     std::shared_ptr<frame_link> data;
+    std::uint64_t lines = 0; /* that it has sent, over all links */
 };
 
 /* Brings a live log until the server has enough of it. */
@@ -118,12 +120,13 @@ task<void> one_device::stream(std::string host, std::uint16_t port, std::string 
     const std::string hello = announcement("10", "DataLink", log == "syslog" ? "syslog_connect" : "modemlog_connect");
     co_await link->send(hello);
     const auto confirmed = co_await link->receive();
-    const std::string line = "Nov 24 12:00:00 vex-device user.notice demo: " + imei + std::string(40, '.') + '\n';
-    std::string lines;
-    for (unsigned i = 0; i < (all.options.rate == 0 ? 160 : 1); ++i)
-        lines += line;
+    const std::string line = "Nov 24 12:00:00 vex-device user.notice demo: " + imei + std::string(40, '.');
+    std::string many;
+    for (unsigned i = 0; i < 160; ++i)
+        many += line + '\n';
     while (confirmed && !link->ended()) {
-        co_await link->send(lines);
+        const std::string bytes = all.options.rate == 0 ? many : line + ' ' + std::to_string(++lines) + '\n';
+        co_await link->send(bytes);
         if (all.options.rate != 0)
             co_await pause(all, 1s / static_cast<double>(all.options.rate) < 1ms ? 1ms : 1000ms / all.options.rate);
     }
@@ -187,6 +190,8 @@ task<void> one_device::live()
     const auto alive = shared_from_this();
     for (;;) {
         control = co_await call(all, all.options.host, all.options.port);
+        if (!control && all.options.other_port != 0)
+            control = co_await call(all, all.options.host, all.options.other_port);
         if (control)
             co_await serve();
         control.reset();
@@ -238,6 +243,7 @@ int main(int argc, char **argv)
     CLI::App app{"Many devices that call a log server."};
     app.add_option("--host", options.host)->capture_default_str();
     app.add_option("--port", options.port)->capture_default_str();
+    app.add_option("--other-port", options.other_port, "of another server, for when that one is away");
     app.add_option("--count", options.count)->capture_default_str();
     app.add_option("--first", options.first, "IMEI of the first")->capture_default_str();
     app.add_option("--cert", options.cert, "their certificate; without it, no TLS");

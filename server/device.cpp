@@ -1,6 +1,7 @@
 #include "server/device.h"
 
 #include "server/fleet.h"
+#include "server/stored_log.h"
 
 #include <algorithm>
 #include <asio/experimental/awaitable_operators.hpp>
@@ -135,13 +136,13 @@ std::string device::at_work() const
     return holder_ + (current_ ? " with command " + current_->msgid : "");
 }
 
-task<bool> device::take_turn(std::string who, std::shared_ptr<wake_up> turn)
+task<bool> device::take_turn(std::string who, std::shared_ptr<wake_up> turn, server_clock::time_point end)
 {
     const auto alive = shared_from_this();
     bool mine = !busy_;
     if (busy_) {
         queue_.push_back(turn);
-        mine = co_await turn->wait();
+        mine = co_await turn->wait(end);
         queue_.remove(turn);
     }
     if (!mine || link->ended())
@@ -205,6 +206,24 @@ task<std::optional<std::string>> device::ask(std::string control)
     const bool answered =
         co_await run(command, std::span(reinterpret_cast<const unsigned char *>(frame.data()), frame.size()));
     co_return answered ? std::optional{command->reply} : std::nullopt;
+}
+
+std::string device::describe(const char *event) const
+{
+    std::string streams;
+    for (std::size_t kind = 0; kind < kLogKinds; ++kind)
+        if (logs_[kind]->running())
+            streams += (streams.empty() ? "" : ",") + std::string(log_name(static_cast<log_kind>(kind)));
+    return tool_json({{"event", event},
+                      {"imei", about.imei},
+                      {"model", about.model},
+                      {"software", about.software},
+                      {"serial", about.serial},
+                      {"address", address},
+                      {"since", utc_text("%Y-%m-%dT%H:%M:%SZ", since)},
+                      {"streams", streams},
+                      {"last", last_command},
+                      {"server", home.name}});
 }
 
 std::string device::called_address() const

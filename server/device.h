@@ -43,9 +43,10 @@ public:
     /* Reads the control link until it ends. */
     task<void> serve();
 
-    /* Waits, by `turn`, until it is the caller's turn to give commands; false when that is given up, or the device is
-     * gone. Whoever has got it gives it back. */
-    task<bool> take_turn(std::string who, std::shared_ptr<wake_up> turn);
+    /* Waits, by `turn`, until it is the caller's turn to give commands; false when that is given up, has not come by
+     * `end`, or the device is gone. Whoever has got it gives it back. */
+    task<bool> take_turn(std::string who, std::shared_ptr<wake_up> turn,
+                         server_clock::time_point end = server_clock::time_point::max());
     void give_turn();
     bool is_busy() const { return busy_; }
     /* Who has the turn, and with what. */
@@ -57,6 +58,8 @@ public:
     /* The same for a command of the server's own: the reply's control text; none when there is no answer. */
     task<std::optional<std::string>> ask(std::string control);
 
+    /* What is told of the device, with what has happened to it: a JSON object. */
+    std::string describe(const char *event) const;
     /* The address at which the device reaches this server. */
     std::string called_address() const;
 

@@ -1,5 +1,7 @@
 #include "server/fleet.h"
 
+#include "server/bus.h"
+
 #include <algorithm>
 #include <cctype>
 #include <netinet/tcp.h>
@@ -143,8 +145,12 @@ task<std::string> fleet::serve_device(std::shared_ptr<frame_link> link, const me
     if (server_.options.imei_in_certificate && link->session() != nullptr && !peer_is_named(link->session(), who.imei))
         co_return "its certificate is for another: " + tool_printable(peer_name(link->session())) + ", not " + who.imei;
     const std::string identity = link->session() != nullptr ? peer_fingerprint(link->session()) : address;
+    bool may_enter = true;
+    if (server_.bus)
+        may_enter = co_await server_.bus->may_take(who.imei, identity);
     const std::shared_ptr<device> older = find(who.imei);
-    const bool may_enter = co_await may_replace(older, identity);
+    if (may_enter)
+        may_enter = co_await may_replace(older, identity);
     if (!may_enter)
         co_return "another device is connected as this one: " + who.imei;
     const auto caller = device::make(server_, link, who, identity, address);
@@ -172,12 +178,23 @@ task<bool> fleet::may_replace(std::shared_ptr<device> older, const std::string &
     co_return older->link->ended();
 }
 
+task<bool> fleet::give_up(std::string imei, std::string identity)
+{
+    const std::shared_ptr<device> held = find(imei);
+    const bool may_go = co_await may_replace(held, identity);
+    if (may_go && held)
+        held->link->end("it has called another server");
+    co_return may_go;
+}
+
 void fleet::enter(const std::shared_ptr<device> &device)
 {
     const device_about &who = device->about;
     if (const auto older = find(who.imei))
         older->link->end("it has called again");
     devices_[who.imei] = device;
+    if (server_.bus)
+        server_.bus->called(*device);
     server_event(server_, "called",
                  {{"imei", who.imei},
                   {"address", device->address},
@@ -194,8 +211,11 @@ void fleet::enter(const std::shared_ptr<device> &device)
 void fleet::leave(const std::shared_ptr<device> &device)
 {
     const auto entry = devices_.find(device->about.imei);
-    if (entry != devices_.end() && entry->second == device)
+    if (entry != devices_.end() && entry->second == device) {
         devices_.erase(entry);
+        if (server_.bus)
+            server_.bus->left(*device);
+    }
     server_event(server_, "left",
                  {{"imei", device->about.imei}, {"address", device->address}, {"why", device->link->why()}});
     for (const auto &watching : std::vector(watchers_))

@@ -28,6 +28,10 @@ public:
                                         std::shared_ptr<wake_up> called);
     const std::map<std::string, std::shared_ptr<device>> &all() const { return devices_; }
 
+    /* Ends the link of a device that has called another server, where it proved to be that; false when it is another
+     * device, which is still there. */
+    task<bool> give_up(std::string imei, std::string identity);
+
     /* Who wants to be told of calls and departures, for as long as the returned handle lives. */
     using watcher = std::function<void(const device &, bool there)>;
     std::shared_ptr<watcher> watch(watcher who);

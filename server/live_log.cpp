@@ -1,5 +1,6 @@
 #include "server/live_log.h"
 
+#include "server/bus.h"
 #include "server/device.h"
 #include "server/store.h"
 
@@ -141,7 +142,7 @@ bool live_log::wanted() const
 {
     const auto device = device_.lock();
     return device && !device->link->ended() &&
-           (stored_ || std::ranges::any_of(followers_, [](const auto &follower) { return follower->wanted; }));
+           (!stored_.empty() || std::ranges::any_of(followers_, [](const auto &follower) { return follower->wanted; }));
 }
 
 void live_log::join(const std::shared_ptr<log_follower> &follower)
@@ -169,7 +170,11 @@ void live_log::leave(const std::shared_ptr<log_follower> &follower)
 void live_log::keep()
 {
     const auto device = device_.lock();
-    stored_ = device->home.store->follow(device->about.imei, kind_);
+    const std::string &imei = device->about.imei;
+    if (device->home.store)
+        stored_.push_back(device->home.store->follow(imei, kind_));
+    if (!device->home.options.spool.empty())
+        stored_.push_back(device->home.bus->follow(imei, kind_));
     if (!running_)
         run_beside(io_, run());
 }
@@ -199,8 +204,8 @@ void live_log::tell_started(const std::string &reply)
         follower->reply = reply;
         follower->started.set();
     }
-    if (stored_)
-        stored_->resumed(this);
+    for (const auto &stored : stored_)
+        stored->resumed(this);
 }
 
 /* Ends those who follow; or only those who followed a log that had begun, as the others wait for the next one. */
@@ -212,8 +217,8 @@ void live_log::tell_ended(const std::string &why, bool to_all)
     for (auto follower = followers_.begin(); follower != staying; ++follower)
         (*follower)->end((*follower)->wanted ? why : "");
     followers_.erase(followers_.begin(), staying);
-    if (stored_)
-        stored_->interrupted(this, why);
+    for (const auto &stored : stored_)
+        stored->interrupted(this, why);
 }
 
 /* Runs the log for as long as somebody wants it. */
@@ -286,8 +291,8 @@ task<void> live_log::relay()
             device->home.metrics.log_lines += lines_in(bytes);
         for (const auto &follower : followers_)
             follower->push(bytes);
-        if (stored_)
-            stored_->append(bytes);
+        for (const auto &stored : stored_)
+            stored->append(bytes);
     }
 }
 

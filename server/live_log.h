@@ -63,7 +63,7 @@ public:
     /* Has a tool follow the log, until it leaves or the log ends. */
     void join(const std::shared_ptr<log_follower> &follower);
     void leave(const std::shared_ptr<log_follower> &follower);
-    /* Has the store follow it for as long as the device is there. */
+    /* Has the store and the bus follow it for as long as the device is there. */
     void keep();
 
     /* Takes a data link that the device has made; false when none is waited for. */
@@ -84,11 +84,11 @@ private:
     asio::io_context &io_;
     const log_kind kind_;
     std::vector<std::shared_ptr<log_follower>> followers_;
-    std::shared_ptr<stored_log> stored_; /* the store follows it */
-    std::shared_ptr<frame_link> link_;   /* the data link */
-    std::string reply_;                  /* to the start that it comes from */
-    wake_up called_;                     /* the data link has come */
-    wake_up left_;                       /* the device */
+    std::vector<std::shared_ptr<stored_log>> stored_; /* where it is kept */
+    std::shared_ptr<frame_link> link_;                /* the data link */
+    std::string reply_;                               /* to the start that it comes from */
+    wake_up called_;                                  /* the data link has come */
+    wake_up left_;                                    /* the device */
     bool running_ = false;
     bool expecting_ = false; /* the data link */
     bool stopping_ = false;  /* the device was told to end the log that link_ brings */

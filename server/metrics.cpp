@@ -1,5 +1,6 @@
 #include "server/metrics.h"
 
+#include "server/bus.h"
 #include "server/fleet.h"
 #include "server/store.h"
 
@@ -52,6 +53,12 @@ std::string text_of(const server &server)
     one("store_lost_bytes_total", "counter", "Bytes that found no room.", static_cast<double>(counts.store_bytes_lost));
     if (server.store)
         one("store_bytes", "gauge", "Bytes that are kept.", static_cast<double>(server.store->total()));
+    if (server.bus) {
+        one("bus_connected", "gauge", "Whether the bus is there.", server.bus->connected() ? 1 : 0);
+        one("bus_records_total", "counter", "Records that the bus has taken.", static_cast<double>(counts.bus_records));
+        one("bus_failures_total", "counter", "Records to send once more.", static_cast<double>(counts.bus_failures));
+        one("spool_bytes", "gauge", "Bytes that the bus has not got.", static_cast<double>(server.bus->spooled()));
+    }
     return out;
 }
 

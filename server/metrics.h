@@ -21,6 +21,8 @@ struct server_metrics {
     std::uint64_t log_lines = 0; /* of system logs */
     std::uint64_t log_gaps = 0;
     std::uint64_t store_bytes_lost = 0;
+    std::uint64_t bus_records = 0;  /* of live logs, that the bus has taken */
+    std::uint64_t bus_failures = 0; /* records that have to be sent once more */
 };
 
 /* Answers every request with the counts until the server ends. */

@@ -1,5 +1,6 @@
 #include "server/server.h"
 
+#include "server/bus.h"
 #include "server/fleet.h"
 #include "server/store.h"
 
@@ -45,9 +46,13 @@ void server_log(const char *what, const tool_members &members)
 void server_event(server &server, const char *what, const tool_members &members)
 {
     server_log(what, members);
-    if (!server.store)
+    if (!server.store && !server.bus)
         return;
-    tool_members all{{"time", utc_text("%Y-%m-%dT%H:%M:%SZ")}, {"event", what}};
+    tool_members all{{"time", utc_text("%Y-%m-%dT%H:%M:%SZ")}, {"event", what}, {"server", server.name}};
     all.insert(all.end(), members.begin(), members.end());
-    server.store->event(tool_json(all));
+    const std::string event = tool_json(all);
+    if (server.store)
+        server.store->event(event);
+    if (server.bus)
+        server.bus->tell(members.front().second, event);
 }

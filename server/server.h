@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+class bus;
 class fleet;
 class log_store;
 
@@ -34,6 +35,14 @@ struct server_options {
     bool compress = false;
     std::vector<std::string> streams; /* "syslog", "qxdm" */
 
+    std::vector<std::string> nats; /* URLs of the message bus; empty: none */
+    std::string nats_credentials;
+    std::string nats_ca;
+    std::string name;            /* of this server among those on the bus; empty: host and port */
+    std::string advertise_tools; /* where tools reach it that another server sends; empty: where it listens for tools */
+    std::string spool;           /* a folder for what the bus has not got yet */
+    std::uint64_t spool_limit = 1'000'000'000; /* bytes */
+
     std::string metrics;
 
     std::chrono::seconds announce_limit{20};
@@ -51,7 +60,10 @@ struct server {
     tls_endpoint tool_tls;
     std::unique_ptr<log_store> store; /* none: nothing is kept; devices use it to their end */
     std::unique_ptr<fleet> devices;
-    std::string port; /* that devices call */
+    std::unique_ptr<class bus> bus; /* none: this is the only server */
+    std::string port;               /* that devices call */
+    std::string name;               /* of this server */
+    std::string tools_address;      /* that tools reach it at */
 };
 
 /* Where the lines of the server's own log go. */
@@ -60,7 +72,7 @@ extern int server_log_fd; /* standard error, unless set otherwise */
 /* Such a line: what happened, to whom. */
 void server_log(const char *what, const tool_members &members);
 
-/* The same, kept with the store's events, too. */
+/* The same of a device, whose IMEI is the first member; among the store's events, too, and on the bus. */
 void server_event(server &server, const char *what, const tool_members &members);
 
 #endif

@@ -20,7 +20,6 @@ using namespace std::chrono_literals;
 
 constexpr auto kCompressLook = 60s; /* from one look for something to compress to the next */
 constexpr std::size_t kFlushAt = 65536;
-constexpr std::size_t kLineMax = 8192; /* a longer line is broken */
 
 std::time_t to_time(fs::file_time_type time)
 {
@@ -28,27 +27,7 @@ std::time_t to_time(fs::file_time_type time)
         std::chrono::time_point_cast<std::chrono::system_clock::duration>(std::chrono::file_clock::to_sys(time)));
 }
 
-/* When a line came: "2026-11-23T12:00:00.123Z ". */
-std::string stamp()
-{
-    const auto now = std::chrono::system_clock::now().time_since_epoch();
-    const auto ms = std::chrono::duration_cast<std::chrono::milliseconds>(now).count() % 1000;
-    char text[16];
-    std::snprintf(text, sizeof text, ".%03dZ ", static_cast<int>(ms));
-    return utc_text("%Y-%m-%dT%H:%M:%S") + text;
-}
-
 } // namespace
-
-std::string utc_text(const char *format)
-{
-    char text[32];
-    const std::time_t now = std::time(nullptr);
-    std::tm utc{};
-    gmtime_r(&now, &utc);
-    std::strftime(text, sizeof text, format, &utc);
-    return text;
-}
 
 kept_file::kept_file(log_store &store, fs::path folder, std::string name, std::string suffix)
     : store_(store), folder_(std::move(folder)), name_(std::move(name)), suffix_(std::move(suffix))
@@ -122,83 +101,6 @@ void kept_file::close()
     ::close(fd_);
     fd_ = -1;
     store_.closed(path_);
-}
-
-stored_log::stored_log(log_store &store, const std::string &imei, log_kind kind, std::time_t last)
-    : store_(store), imei_(imei), kind_(kind), file_(store, fs::path(store.home.options.store) / imei, log_name(kind),
-                                                     kind == log_kind::syslog ? ".log" : ".bin"),
-      since_(last)
-{
-}
-
-void stored_log::append_lines(std::string_view bytes)
-{
-    const std::string now = stamp();
-    while (!bytes.empty()) {
-        if (line_.empty())
-            line_ = now;
-        const std::size_t newline = bytes.find('\n');
-        const std::size_t taken = std::min({newline == bytes.npos ? newline : newline + 1, bytes.size(), kLineMax});
-        line_ += bytes.substr(0, taken);
-        bytes.remove_prefix(taken);
-        if (!line_.ends_with('\n') && line_.size() < kLineMax)
-            continue;
-        if (!line_.ends_with('\n'))
-            line_ += '\n';
-        file_.append(line_);
-        line_.clear();
-    }
-}
-
-void stored_log::append(std::string_view bytes)
-{
-    tell_lost();
-    if (kind_ == log_kind::syslog)
-        append_lines(bytes);
-    else
-        file_.append(bytes);
-}
-
-/* Says what is missing: in the log itself where that is text, and among the events. */
-void stored_log::tell(const std::string &what)
-{
-    ++store_.home.metrics.log_gaps;
-    if (kind_ == log_kind::syslog)
-        file_.append(stamp() + "# vex_log_server: " + what + '\n');
-    server_event(store_.home, "gap", {{"imei", imei_}, {"log", log_name(kind_)}, {"what", what}});
-}
-
-void stored_log::tell_lost()
-{
-    const std::uint64_t lost = file_.take_lost();
-    if (lost == 0)
-        return;
-    if (kind_ == log_kind::syslog)
-        file_.append("\n"); /* a line may have been cut */
-    tell(std::to_string(lost) + " bytes are missing: " + file_.why_lost());
-}
-
-void stored_log::interrupted(const live_log *source, const std::string &why)
-{
-    if (source != source_)
-        return;
-    source_ = nullptr;
-    since_ = std::time(nullptr);
-    why_ = why;
-    if (!line_.empty()) {
-        file_.append(line_ + '\n');
-        line_.clear();
-    }
-    file_.flush();
-    file_.close(); /* it may be for good */
-}
-
-void stored_log::resumed(const live_log *source)
-{
-    source_ = source;
-    if (since_ != 0)
-        tell("nothing came for " + std::to_string(std::time(nullptr) - since_) + " s: " + why_);
-    since_ = 0;
 }
 
 log_store::log_store(server &server) : home(server), folder_(server.options.store) {}
@@ -370,7 +272,10 @@ std::shared_ptr<stored_log> log_store::follow(const std::string &imei, log_kind 
 {
     std::shared_ptr<stored_log> &log = logs_[{imei, kind}];
     if (!log)
-        log = std::make_shared<stored_log>(*this, imei, kind, last_write(imei, kind));
+        log = std::make_shared<stored_log>(home, imei, kind, "store",
+                                           std::make_unique<kept_file>(*this, folder_ / imei, log_name(kind),
+                                                                       kind == log_kind::syslog ? ".log" : ".bin"),
+                                           last_write(imei, kind));
     return log;
 }
 

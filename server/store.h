@@ -7,6 +7,7 @@
 
 #include "server/live_log.h"
 #include "server/server.h"
+#include "server/stored_log.h"
 
 #include <asio/thread_pool.hpp>
 #include <filesystem>
@@ -19,26 +20,22 @@
 
 class log_store;
 
-/* The time as strftime() writes it, in UTC. */
-std::string utc_text(const char *format);
-
 /* A file that is written to, and the ones after it: NAME-DATE.SUFFIX, NAME-DATE.1.SUFFIX, ...; those before it may have
  * been compressed. */
-class kept_file
+class kept_file : public log_output
 {
 public:
     kept_file(log_store &store, std::filesystem::path folder, std::string name, std::string suffix);
-    ~kept_file();
+    ~kept_file() override;
     kept_file(const kept_file &) = delete;
 
     /* Takes bytes, which are in the file within a second. */
-    void append(std::string_view bytes);
-    /* Writes what was taken. Bytes that find no room are counted. */
-    void flush();
+    void append(std::string_view bytes) override;
+    void flush() override;
     /* Goes on with another file. */
-    void close();
-    std::uint64_t take_lost() { return std::exchange(lost_, 0); }
-    const char *why_lost() const { return why_lost_; }
+    void close() override;
+    std::uint64_t take_lost() override { return std::exchange(lost_, 0); }
+    std::string why_lost() const override { return why_lost_; }
 
 private:
     bool open();
@@ -54,35 +51,6 @@ private:
     std::string waiting_;
     std::uint64_t lost_ = 0;
     const char *why_lost_ = "";
-};
-
-/* A live log that is kept, over all the links that bring it. Each line of the system log gets the time at which it
- * came. */
-class stored_log
-{
-public:
-    /* `last`: when something was kept last, by this server or one before it; 0: never. */
-    stored_log(log_store &store, const std::string &imei, log_kind kind, std::time_t last);
-
-    void append(std::string_view bytes);
-    /* The log has begun again, from that source; it has ended, unless another source has begun meanwhile. What is missing
-     * in between is told. */
-    void resumed(const live_log *source);
-    void interrupted(const live_log *source, const std::string &why);
-
-private:
-    void append_lines(std::string_view bytes);
-    void tell(const std::string &what);
-    void tell_lost();
-
-    log_store &store_;
-    const std::string imei_;
-    const log_kind kind_;
-    kept_file file_;
-    std::string line_;                 /* that is not whole yet, with its time */
-    const live_log *source_ = nullptr; /* that brings it now */
-    std::time_t since_;                /* of an interruption; 0: there is none */
-    std::string why_ = "the server was not there";
 };
 
 class log_store

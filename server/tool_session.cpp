@@ -1,10 +1,10 @@
 #include "server/tool_session.h"
 
+#include "server/bus.h"
 #include "server/fleet.h"
 
 #include <asio/experimental/awaitable_operators.hpp>
 #include <charconv>
-#include <ctime>
 #include <pwd.h>
 #include <sys/socket.h>
 
@@ -19,6 +19,7 @@ constexpr auto kHandshakeMax = 20s;
 constexpr auto kIdleMax = 60s;               /* for a tool to give its next command while it has a device */
 constexpr std::size_t kAheadMax = 128 << 10; /* bytes that a tool may send before it is its turn */
 constexpr unsigned kWaitMost = 86400;        /* s that a tool may want to wait */
+constexpr auto kLookElsewhere = 2s;          /* whether a device that is waited for has called another server */
 
 /* One tool. */
 struct tool_session {
@@ -58,60 +59,39 @@ task<bool> begin_log(tool_session &tool, const std::string &reply)
     return say(tool, make_frame(R"({"msgid":"stream","Result":"Success"})", reply));
 }
 
-std::string time_text(std::time_t when)
+constexpr char kDevicesHead[] = R"({"msgid":"devices","Result":"Success"})";
+
+/* The devices of this server and of all others, a line each, in the data parts of as many frames as it takes. */
+task<std::vector<std::string>> device_frames(server &home)
 {
-    char text[32];
-    std::tm utc{};
-    gmtime_r(&when, &utc);
-    std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &utc);
-    return text;
+    std::string lines;
+    for (const auto &[imei, device] : home.devices->all())
+        lines += device->describe("there") + '\n';
+    if (home.bus)
+        lines += co_await home.bus->list();
+    std::vector<std::string> frames;
+    for (std::size_t at = 0, end = 0; at < lines.size(); at = end) {
+        end = lines.size() - at <= kPkgDataMax ? lines.size() : lines.rfind('\n', at + kPkgDataMax - 1) + 1;
+        frames.push_back(make_frame(kDevicesHead, std::string_view(lines).substr(at, end - at)));
+    }
+    co_return frames;
 }
 
-std::string streams_of(device &device)
-{
-    std::string names;
-    for (std::size_t kind = 0; kind < kLogKinds; ++kind)
-        if (device.log(static_cast<log_kind>(kind)).running())
-            names += (names.empty() ? "" : ",") + std::string(log_name(static_cast<log_kind>(kind)));
-    return names;
-}
-
-/* What the server tells of a device. */
-std::string describe(device &device, const char *event)
-{
-    return tool_json({{"event", event},
-                      {"imei", device.about.imei},
-                      {"model", device.about.model},
-                      {"software", device.about.software},
-                      {"serial", device.about.serial},
-                      {"address", device.address},
-                      {"since", time_text(device.since)},
-                      {"streams", streams_of(device)},
-                      {"last", device.last_command}});
-}
-
-/* Tells all devices, a line each, in the data parts of as many frames as it takes and one without data behind them; then,
- * if that is wanted, who calls and who leaves until the tool has enough. */
+/* Tells all devices, with a frame without data behind them; then, if that is wanted, who calls and who leaves until the
+ * tool has enough. */
 task<void> list_devices(tool_session &tool, bool watch)
 {
-    constexpr char kHead[] = R"({"msgid":"devices","Result":"Success"})";
     std::deque<std::string> changes;
     wake_up changed(tool.home.io);
-    const auto watching = tool.home.devices->watch([&](const device &device, bool there) {
-        changes.push_back(describe(const_cast<class device &>(device), there ? "called" : "left") + '\n');
+    const auto note = [&](const std::string &line) {
+        changes.push_back(line + '\n');
         changed.set();
-    });
-    std::string lines;
-    std::vector<std::string> frames;
-    for (const auto &[imei, device] : tool.home.devices->all()) {
-        const std::string line = describe(*device, "there") + '\n';
-        if (lines.size() + line.size() > kPkgDataMax)
-            frames.push_back(make_frame(kHead, std::exchange(lines, "")));
-        lines += line;
-    }
-    if (!lines.empty())
-        frames.push_back(make_frame(kHead, lines));
-    frames.push_back(make_frame(kHead));
+    };
+    const auto watching = tool.home.devices->watch(
+        [&](const device &device, bool there) { note(device.describe(there ? "called" : "left")); });
+    const auto watching_others = watch && tool.home.bus ? tool.home.bus->watch(note) : nullptr;
+    std::vector<std::string> frames = co_await device_frames(tool.home);
+    frames.push_back(make_frame(kDevicesHead));
     for (const std::string &frame : frames) {
         const bool said = co_await say(tool, frame);
         if (!said)
@@ -122,7 +102,7 @@ task<void> list_devices(tool_session &tool, bool watch)
             co_await changed.wait();
             changed.reset();
             while (!changes.empty()) {
-                const std::string frame = make_frame(kHead, changes.front());
+                const std::string frame = make_frame(kDevicesHead, changes.front());
                 changes.pop_front();
                 co_await say(tool, frame);
             }
@@ -165,16 +145,36 @@ template <class T> task<T> wait_for(tool_session &tool, std::shared_ptr<wake_up>
     co_return result;
 }
 
-/* The device that a tool names, when it is there, or comes in the time that the tool has. */
+/* Sends the tool to the other server that has a device, if there is one. */
+task<bool> send_elsewhere(tool_session &tool, std::string msgid, std::string imei)
+{
+    if (!tool.home.bus)
+        co_return false;
+    const std::string address = co_await tool.home.bus->find(imei);
+    if (address.empty())
+        co_return false;
+    const tool_members answer{{"msgid", msgid}, {"Result", "Elsewhere"}, {"server", address}};
+    co_await say(tool, make_frame(tool_json(answer)));
+    co_return true;
+}
+
+/* The device that a tool names, when it is there, or comes in the time that the tool has. None, and the tool knows why. */
 task<std::shared_ptr<device>> find_device(tool_session &tool, const message &request)
 {
     const std::string imei = request.text("imei");
     const auto end = wait_end(request);
     std::shared_ptr<device> found = tool.home.devices->find(imei);
-    if (!found && end > server_clock::now()) {
-        co_await let_wait(tool, request.msgid(), "the device is not connected");
+    for (bool told = false; !found && !tool.link->ended(); told = true) {
+        const bool sent = co_await send_elsewhere(tool, request.msgid(), imei);
+        if (sent)
+            co_return nullptr;
+        if (server_clock::now() >= end)
+            break;
+        if (!told)
+            co_await let_wait(tool, request.msgid(), "the device is not connected");
         const auto called = std::make_shared<wake_up>(tool.home.io);
-        found = co_await wait_for(tool, called, tool.home.devices->await(imei, end, called));
+        const auto look = tool.home.bus ? std::min(end, server_clock::now() + kLookElsewhere) : end;
+        found = co_await wait_for(tool, called, tool.home.devices->await(imei, look, called));
     }
     if (!found)
         co_await fail(tool, request.msgid(), "no device " + tool_printable(imei.substr(0, 64)) + " is connected");

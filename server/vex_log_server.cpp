@@ -1,10 +1,12 @@
 /* The log server of a fleet: its command line, its start and its end. */
+#include "server/bus.h"
 #include "server/fleet.h"
 #include "server/server.h"
 #include "server/store.h"
 #include "server/tool_session.h"
 
 #include <CLI/CLI.hpp>
+#include <algorithm>
 #include <asio/ip/v6_only.hpp>
 #include <asio/signal_set.hpp>
 #include <csignal>
@@ -14,6 +16,7 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
+#include <unistd.h>
 
 namespace
 {
@@ -61,8 +64,7 @@ void add_store_options(CLI::App &app, server_options &options)
     app.add_option("--store", options.store, "folder to keep live logs and events in");
     app.add_option("--stream", options.streams, "logs to keep of every device: syslog, qxdm")
         ->delimiter(',')
-        ->check(CLI::IsMember({"syslog", "qxdm"}))
-        ->needs("--store");
+        ->check(CLI::IsMember({"syslog", "qxdm"}));
     app.add_option("--store-limit", options.store_limit, "most that is kept, such as 10GB; the oldest goes first")
         ->transform(bytes)
         ->capture_default_str();
@@ -70,6 +72,39 @@ void add_store_options(CLI::App &app, server_options &options)
     app.add_flag("--compress", options.compress, "compress the files that are followed by others, with zstd");
     app.add_option("--rotate", options.rotate_size, "size at which a file is followed by the next")
         ->transform(bytes)
+        ->capture_default_str();
+}
+
+/* What parts of a subject, and keys of a bucket, are made of. */
+const CLI::Validator kBusName(
+    [](const std::string &text) {
+        const auto is_fit = [](unsigned char c) { return std::isalnum(c) != 0 || c == '-' || c == '_'; };
+        return !text.empty() && std::ranges::all_of(text, is_fit) ? "" : "a name is of letters, digits, - and _";
+    },
+    "");
+
+void add_bus_options(CLI::App &app, server_options &options)
+{
+    CLI::Option *const nats =
+        app.add_option("--nats", options.nats, "URLs of the NATS servers by which several log servers are one")
+            ->delimiter(',')
+            ->type_name("URL");
+    app.add_option("--nats-name", options.name, "this server's name there, if not HOST-PORT")
+        ->check(kBusName)
+        ->needs(nats);
+    app.add_option("--nats-creds", options.nats_credentials, "credentials for NATS")
+        ->check(CLI::ExistingFile)
+        ->needs(nats);
+    app.add_option("--nats-ca", options.nats_ca, "certificate that NATS' are signed by: TLS")
+        ->check(CLI::ExistingFile)
+        ->needs(nats);
+    app.add_option("--advertise-tools", options.advertise_tools,
+                   "address that tools are told to go to, if not --tools-listen or --tools")
+        ->needs(nats);
+    app.add_option("--spool", options.spool, "folder for what JetStream has not got yet of the logs of --stream")
+        ->needs(nats);
+    app.add_option("--spool-limit", options.spool_limit, "most that is there; more is lost, and told")
+        ->transform(CLI::AsSizeValue(false))
         ->capture_default_str();
 }
 
@@ -181,6 +216,16 @@ task<void> reload(server &server)
     }
 }
 
+/* What a server is called that was given no name: by host and port. */
+std::string default_name(const std::string &port)
+{
+    char host[65] = "";
+    gethostname(host, sizeof host - 1);
+    std::string name = std::string(host) + '-' + port;
+    std::ranges::replace(name, '.', '_');
+    return name;
+}
+
 /* Begins to serve; false, and why, when that can't be. */
 bool start(server &server, std::string &why)
 {
@@ -194,6 +239,12 @@ bool start(server &server, std::string &why)
     if (!devices || !tools)
         return false;
     server.port = std::to_string(devices->local_endpoint().port());
+    server.name = options.name.empty() ? default_name(server.port) : options.name;
+    server.tools_address = !options.advertise_tools.empty() ? options.advertise_tools
+                           : !options.tools_listen.empty()  ? options.tools_listen
+                                                            : options.tools;
+    if (!options.nats.empty() && !(server.bus = bus::open(server, why)))
+        return false;
     run_beside(server.io, server.devices->listen(std::move(*devices)));
     run_beside(server.io, serve_local_tools(server, std::move(*tools)));
     using serve = task<void> (*)(struct server &, tcp::acceptor);
@@ -240,9 +291,14 @@ int serve(const server_options &options)
     server_log("ends", {{"devices", std::to_string(server.devices->all().size())}});
     server.devices->end_all();
     io.restart();
+    bool bus_ended = server.bus == nullptr;
+    if (server.bus)
+        asio::co_spawn(io, server.bus->end(), [&bus_ended](const std::exception_ptr &) { bus_ended = true; });
     for (const auto until = server_clock::now() + kEndMax;
-         !server.devices->all().empty() && server_clock::now() < until;)
+         !(server.devices->all().empty() && bus_ended) && server_clock::now() < until;)
         io.run_one_for(100ms);
+    if (server.bus)
+        server.bus->flush();
     std::filesystem::remove(options.tools);
     server.store.reset();
     std::fflush(nullptr);
@@ -259,6 +315,7 @@ int main(int argc, char **argv)
     add_device_options(app, options);
     add_tool_options(app, options);
     add_store_options(app, options);
+    add_bus_options(app, options);
     CLI11_PARSE(app, argc, argv);
     if (!options.plain && (options.cert.empty() || options.key.empty() || options.ca.empty())) {
         std::fprintf(stderr, "vex_log_server: over TLS it needs --cert, --key and --ca; without TLS, --plain\n");
@@ -266,6 +323,10 @@ int main(int argc, char **argv)
     }
     if (!options.tools_listen.empty() && (options.cert.empty() || options.key.empty() || options.tools_ca.empty())) {
         std::fprintf(stderr, "vex_log_server: --tools-listen needs --cert, --key and --tools-ca\n");
+        return 2;
+    }
+    if (!options.streams.empty() && options.store.empty() && options.spool.empty()) {
+        std::fprintf(stderr, "vex_log_server: --stream needs --store, or --nats and --spool\n");
         return 2;
     }
     return serve(options);

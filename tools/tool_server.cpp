@@ -12,6 +12,7 @@ namespace
 {
 
 constexpr auto kForEver = std::chrono::hours(24 * 365);
+constexpr int kSentMost = 3; /* times that a server sends us to another */
 
 /* Connects to a unix socket. */
 std::optional<tool_link> connect_local(const std::string &path, const tool_limits &limits, std::string &why)
@@ -94,14 +95,17 @@ void show(tool_entry &entry, bool json)
                 entry["streams"].empty() ? "-" : entry["streams"].c_str(), entry["last"].c_str());
 }
 
-} // namespace
-
-std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_limits &limits,
-                                         const tool_members &request, tool_frame &answer, std::string &why)
+bool is_local(const std::string &address)
 {
-    std::optional<tool_link> link = server.address.find('/') != std::string::npos
-                                        ? connect_local(server.address, limits, why)
-                                        : connect_remote(server, limits, why);
+    return address.find('/') != std::string::npos;
+}
+
+/* Asks one server; `elsewhere`: the one that it knows to have the device. */
+std::optional<tool_link> ask_one(const tool_server &server, const tool_limits &limits, const tool_members &request,
+                                 tool_frame &answer, std::string &elsewhere, std::string &why)
+{
+    std::optional<tool_link> link =
+        is_local(server.address) ? connect_local(server.address, limits, why) : connect_remote(server, limits, why);
     if (!link || !tool_send(*link, tool_json(request), {}, why))
         return std::nullopt;
     for (;;) {
@@ -114,12 +118,36 @@ std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_l
             answer = *frame;
             return link;
         }
+        if (result == "Elsewhere") {
+            elsewhere = text_of(root.get(), "server");
+            why = "the log server does not say where the device is";
+            return std::nullopt;
+        }
         if (result != "Waiting") {
             why = "the log server says: " + tool_printable(result.starts_with("Fail:") ? result.substr(5) : result);
             return std::nullopt;
         }
         std::fprintf(stderr, "Waiting: %s.\n", tool_printable(text_of(root.get(), "reason")).c_str());
     }
+}
+
+} // namespace
+
+std::optional<tool_link> tool_ask_server(const tool_server &server, const tool_limits &limits,
+                                         const tool_members &request, tool_frame &answer, std::string &why)
+{
+    tool_server asked = server;
+    for (int sent = 0; sent <= kSentMost; ++sent) {
+        std::string elsewhere;
+        std::optional<tool_link> link = ask_one(asked, limits, request, answer, elsewhere, why);
+        if (link || elsewhere.empty())
+            return link;
+        if (is_local(elsewhere) && !is_local(asked.address))
+            break;
+        asked.address = elsewhere;
+    }
+    why = "the log server sends us from place to place, last to " + tool_printable(asked.address);
+    return std::nullopt;
 }
 
 std::optional<std::vector<tool_entry>> tool_list_devices(const tool_server &server, const tool_limits &limits,
