@@ -85,6 +85,9 @@ void nats_link::connect()
         natsConnection *connection = nullptr;
         const natsStatus status = natsConnection_Connect(&connection, options_.get());
         session->connection.reset(connection);
+        const char *reason = nullptr;
+        natsConnection_GetLastError(connection, &reason);
+        const std::string why = reason != nullptr && *reason != '\0' ? reason : natsStatus_GetText(status);
         jsOptions options;
         jsOptions_Init(&options);
         options.Wait = kAskMax;
@@ -94,7 +97,7 @@ void nats_link::connect()
         if (connection != nullptr)
             natsConnection_JetStream(&stream, connection, &options);
         session->stream.reset(stream);
-        asio::post(io_, [this, session, status] { connected(session, natsStatus_GetText(status)); });
+        asio::post(io_, [this, session, why] { connected(session, why); });
     });
 }
 
