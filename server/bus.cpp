@@ -10,6 +10,7 @@ namespace
 using namespace std::chrono_literals;
 
 constexpr auto kGiveUpMax = 15s;        /* for another server to find out whether a device is still there */
+constexpr auto kWhereMax = 2s;          /* for it to say where it is */
 constexpr auto kListMax = 2s;           /* for another server to tell of its devices */
 constexpr auto kTurnMax = 60s;          /* for a command to begin */
 constexpr unsigned kUnderWayMost = 100; /* commands for a device */
@@ -99,7 +100,13 @@ void bus::left(const device &device)
 task<std::string> bus::find(std::string imei)
 {
     const auto other = co_await directory_.find(imei);
-    co_return other ? other->tools : "";
+    if (other)
+        co_return other->tools;
+    if (commands_.contains(imei) || !is_imei(imei))
+        co_return "";
+    /* A copy of the bucket may be behind, or none be had: who takes the device's commands knows, too. */
+    const auto reply = co_await link_->request("vex.command." + imei, R"({"msgid":"where"})", kWhereMax);
+    co_return reply ? message(*reply).text("tools") : "";
 }
 
 task<std::string> bus::list()
@@ -111,6 +118,8 @@ task<std::string> bus::list()
         for (;;) {
             const std::string question = tool_json({{"ask", "devices"}, {"after", after}});
             const auto part = co_await link_->request("vex.server." + other.name, question, kListMax);
+            if (!part)
+                server_log("a server does not tell its devices", {{"server", other.name}});
             if (!part || !part->ends_with('\n'))
                 break;
             lines += *part;
@@ -180,6 +189,8 @@ task<void> bus::carry_out(nats_message request, std::string imei)
 task<std::string> bus::command(std::string imei, std::string control)
 {
     const std::string msgid = message(control).msgid();
+    if (msgid == "where")
+        co_return tool_json({{"msgid", msgid}, {"tools", home_.tools_address}});
     if (!is_short(msgid) || control.size() > kPkgControlMax)
         co_return failure(msgid, "this is no short command");
     const std::shared_ptr<device> device = home_.devices->find(imei);

@@ -14,6 +14,7 @@ constexpr auto kRefresh = 20min;        /* from one time that a device's entry i
 constexpr int64_t kForgetDevice = 3600; /* s after which one is gone that nobody writes */
 constexpr int64_t kDuplicates = 300;    /* s for which JetStream knows a record that comes twice */
 constexpr auto kAgainAfter = 1s;        /* when something could not be written */
+constexpr int kKeysTries = 3;           /* to list the servers, which fails while JetStream elects a leader */
 constexpr std::size_t kAtOnce = 64;     /* devices */
 constexpr int64_t kSecond = 1'000'000'000;
 constexpr int kReplicas = 3; /* of everything, where NATS is a cluster */
@@ -284,8 +285,9 @@ task<std::vector<server_place>> directory::others()
     std::function<result(nats_session &)> look = [from = buckets_, own = home_.name](nats_session &) {
         result found;
         kvKeysList keys{};
-        if (kvStore_Keys(&keys, from->servers.get(), nullptr) != NATS_OK)
-            return found;
+        for (int tries = 0; kvStore_Keys(&keys, from->servers.get(), nullptr) != NATS_OK; ++tries)
+            if (tries == kKeysTries)
+                return found;
         for (int i = 0; i < keys.Count; ++i)
             if (const auto tools =
                     keys.Keys[i] != own ? value_of(from->servers.get(), keys.Keys[i], from->answer) : std::nullopt)

@@ -28,13 +28,6 @@ void set_keepalive(int fd, int idle, int interval, int count)
         setsockopt(fd, IPPROTO_TCP, name, &value, sizeof value);
 }
 
-/* Whether a device can be known by that: it becomes part of file names, too. */
-bool is_imei(const std::string &text)
-{
-    return !text.empty() && text.size() <= 32 &&
-           std::ranges::all_of(text, [](unsigned char c) { return std::isalnum(c) != 0 || c == '-' || c == '_'; });
-}
-
 device_about about(const message &announcement)
 {
     const auto text = [&announcement](const char *name) {
@@ -56,6 +49,12 @@ struct caller_count {
 };
 
 } // namespace
+
+bool is_imei(const std::string &text)
+{
+    return !text.empty() && text.size() <= 32 &&
+           std::ranges::all_of(text, [](unsigned char c) { return std::isalnum(c) != 0 || c == '-' || c == '_'; });
+}
 
 task<void> fleet::listen(asio::ip::tcp::acceptor listener)
 {

@@ -11,6 +11,9 @@
 #include <memory>
 #include <string>
 
+/* Whether a device can be known by that: it becomes part of file names, and of the bus's subjects, too. */
+bool is_imei(const std::string &text);
+
 class fleet
 {
 public:
