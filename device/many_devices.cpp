@@ -151,6 +151,8 @@ task<void> one_device::answer(message command)
     if (msgid == "3")
         reply = R"({"msgid":"3","getVersionInfo":{"VersionInfo":"V1","projectName":"VX-1","imei":")" + imei +
                 R"("},"Result":"Success"})";
+    if (msgid == "11")
+        reply = R"({"msgid":"11","mode_lpm_online":"online","Result":"Success"})";
     const std::string frame = make_frame(reply);
     co_await control->send(frame);
     if (msgid != "6")

@@ -10,7 +10,7 @@ namespace
 using namespace std::chrono_literals;
 
 constexpr auto kGiveUpMax = 15s;        /* for another server to find out whether a device is still there */
-constexpr auto kWhereMax = 2s;          /* for it to say where it is */
+constexpr auto kWhereMax = 2s;          /* for a server to say that it has a device */
 constexpr auto kListMax = 2s;           /* for another server to tell of its devices */
 constexpr auto kTurnMax = 60s;          /* for a command to begin */
 constexpr unsigned kUnderWayMost = 100; /* commands for a device */
@@ -52,8 +52,7 @@ std::unique_ptr<bus> bus::open(server &server, std::string &why)
 }
 
 bus::bus(server &server, std::unique_ptr<nats_link> link)
-    : home_(server), link_(std::move(link)), directory_(server, *link_, [this] { spool_.set_ready(true); }),
-      spool_(server, *link_)
+    : home_(server), link_(std::move(link)), directory_(server, *link_), spool_(server, *link_)
 {
     questions_ = link_->subscribe("vex.server." + home_.name, "",
                                   [this](const nats_message &request) { run_beside(home_.io, answer(request)); });
@@ -66,17 +65,28 @@ void bus::changed(bool connected, const std::string &why)
     else
         server_log("the bus is away", {{"why", why}});
     directory_.set_connected(connected);
-    if (!connected)
-        spool_.set_ready(false);
+    if (!home_.options.spool.empty())
+        spool_.set_connected(connected);
+}
+
+/* Asks whoever takes the device's commands. That knows better than a bucket, which a node answers for that may be behind;
+ * and where no server has the device, NATS says so at once. */
+task<bus::place> bus::place_of(std::string imei)
+{
+    if (commands_.contains(imei) || !is_imei(imei))
+        co_return place();
+    const auto reply = co_await link_->request("vex.command." + imei, R"({"msgid":"where"})", kWhereMax);
+    const message answer(reply.value_or(""));
+    co_return place{answer.text("server"), answer.text("tools")};
 }
 
 task<bool> bus::may_take(std::string imei, std::string identity)
 {
-    const auto other = co_await directory_.find(imei);
-    if (!other)
+    const place other = co_await place_of(imei);
+    if (other.server.empty())
         co_return true;
     const std::string question = tool_json({{"ask", "give up"}, {"imei", imei}, {"identity", identity}});
-    const auto reply = co_await link_->request("vex.server." + other->name, question, kGiveUpMax);
+    const auto reply = co_await link_->request("vex.server." + other.server, question, kGiveUpMax);
     co_return !reply || message(*reply).text("Result") == "Success";
 }
 
@@ -99,35 +109,37 @@ void bus::left(const device &device)
 
 task<std::string> bus::find(std::string imei)
 {
-    const auto other = co_await directory_.find(imei);
-    if (other)
-        co_return other->tools;
-    if (commands_.contains(imei) || !is_imei(imei))
-        co_return "";
-    /* A copy of the bucket may be behind, or none be had: who takes the device's commands knows, too. */
-    const auto reply = co_await link_->request("vex.command." + imei, R"({"msgid":"where"})", kWhereMax);
-    co_return reply ? message(*reply).text("tools") : "";
+    const place other = co_await place_of(imei);
+    co_return other.tools;
 }
 
-task<std::string> bus::list()
+/* The devices of one other server; false when it does not answer. */
+task<bool> bus::list_server(std::string name, std::string &lines)
+{
+    for (std::string after;;) {
+        const std::string question = tool_json({{"ask", "devices"}, {"after", after}});
+        const auto part = co_await link_->request("vex.server." + name, question, kListMax);
+        if (!part || part->empty())
+            co_return part.has_value();
+        lines += *part;
+        const std::size_t last = part->size() > 1 ? part->rfind('\n', part->size() - 2) + 1 : 0;
+        const std::string next = message(std::string_view(*part).substr(last)).text("imei");
+        if (next <= after)
+            co_return false;
+        after = next;
+    }
+}
+
+task<std::string> bus::list(std::string &missing)
 {
     std::string lines;
-    const std::vector<server_place> others = co_await directory_.others();
-    for (const server_place &other : others) {
-        std::string after;
-        for (;;) {
-            const std::string question = tool_json({{"ask", "devices"}, {"after", after}});
-            const auto part = co_await link_->request("vex.server." + other.name, question, kListMax);
-            if (!part)
-                server_log("a server does not tell its devices", {{"server", other.name}});
-            if (!part || !part->ends_with('\n'))
-                break;
-            lines += *part;
-            const std::size_t last = part->size() > 1 ? part->rfind('\n', part->size() - 2) + 1 : 0;
-            after = message(std::string_view(*part).substr(last)).text("imei");
-            if (after.empty())
-                break;
-        }
+    const auto others = co_await directory_.others();
+    if (!others)
+        missing = "of other servers, as the bus does not answer";
+    for (const std::string &name : others.value_or(std::vector<std::string>())) {
+        const bool answers = co_await list_server(name, lines);
+        if (!answers)
+            missing = "of server " + name + ", which does not answer";
     }
     co_return lines;
 }
@@ -174,8 +186,14 @@ std::shared_ptr<nats_subscription> bus::watch(std::function<void(const std::stri
 /* Has a command carried out that has come over the bus, and answers it. */
 task<void> bus::carry_out(nats_message request, std::string imei)
 {
+    const std::string msgid = message(request.data).msgid();
+    if (msgid == "where") {
+        link_->publish(request.reply,
+                       tool_json({{"msgid", msgid}, {"server", home_.name}, {"tools", home_.tools_address}}));
+        co_return;
+    }
     if (under_way_[imei] >= kUnderWayMost) {
-        link_->publish(request.reply, failure(message(request.data).msgid(), "too many commands wait for the device"));
+        link_->publish(request.reply, failure(msgid, "too many commands wait for the device"));
         co_return;
     }
     ++under_way_[imei];
@@ -189,8 +207,6 @@ task<void> bus::carry_out(nats_message request, std::string imei)
 task<std::string> bus::command(std::string imei, std::string control)
 {
     const std::string msgid = message(control).msgid();
-    if (msgid == "where")
-        co_return tool_json({{"msgid", msgid}, {"tools", home_.tools_address}});
     if (!is_short(msgid) || control.size() > kPkgControlMax)
         co_return failure(msgid, "this is no short command");
     const std::shared_ptr<device> device = home_.devices->find(imei);

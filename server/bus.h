@@ -31,8 +31,8 @@ public:
 
     /* The address for tools of the other server that has a device; empty when none has. */
     task<std::string> find(std::string imei);
-    /* The devices of all other servers, a line of JSON each. */
-    task<std::string> list();
+    /* The devices of all other servers, a line of JSON each; `missing`: which are not known, if so. */
+    task<std::string> list(std::string &missing);
 
     /* Tells what has happened, as JSON. */
     void tell(const std::string &imei, const std::string &event);
@@ -51,7 +51,14 @@ public:
 
 private:
     bus(server &server, std::unique_ptr<nats_link> link);
+    /* Which other server has a device, as that says itself. */
+    struct place {
+        std::string server;
+        std::string tools; /* its address for tools */
+    };
+    task<place> place_of(std::string imei);
     void changed(bool connected, const std::string &why);
+    task<bool> list_server(std::string name, std::string &lines);
     task<void> carry_out(nats_message request, std::string imei);
     task<std::string> command(std::string imei, std::string control);
     task<void> answer(nats_message request);

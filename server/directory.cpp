@@ -1,7 +1,6 @@
 #include "server/directory.h"
 
 #include "server/fleet.h"
-#include "server/spool.h"
 
 namespace
 {
@@ -12,14 +11,10 @@ constexpr auto kAlive = 5s;             /* from one sign of life to the next */
 constexpr int64_t kForget = 15;         /* s after which a server without is dead */
 constexpr auto kRefresh = 20min;        /* from one time that a device's entry is written to the next */
 constexpr int64_t kForgetDevice = 3600; /* s after which one is gone that nobody writes */
-constexpr int64_t kDuplicates = 300;    /* s for which JetStream knows a record that comes twice */
 constexpr auto kAgainAfter = 1s;        /* when something could not be written */
 constexpr int kKeysTries = 3;           /* to list the servers, which fails while JetStream elects a leader */
 constexpr std::size_t kAtOnce = 64;     /* devices */
 constexpr int64_t kSecond = 1'000'000'000;
-constexpr int kReplicas = 3; /* of everything, where NATS is a cluster */
-
-constexpr int kNotClustered = 10074; /* JetStream: no replicas without a cluster */
 
 /* Makes a bucket unless it is there. */
 nats_bucket_ptr bucket(nats_session &session, const char *name, int64_t forget)
@@ -32,39 +27,11 @@ nats_bucket_ptr bucket(nats_session &session, const char *name, int64_t forget)
     config.Bucket = name;
     config.TTL = forget * kSecond;
     config.History = 1;
-    config.Replicas = kReplicas;
-    natsStatus status = js_CreateKeyValue(&made, session.stream.get(), &config);
-    if (status != NATS_OK && std::string(nats_GetLastError(nullptr)).find("non-clustered") != std::string::npos) {
-        config.Replicas = 1;
-        status = js_CreateKeyValue(&made, session.stream.get(), &config);
-    }
-    return nats_bucket_ptr(status == NATS_OK ? made : nullptr);
-}
-
-/* Makes the stream for live logs unless it is there. */
-bool has_log_stream(nats_session &session, unsigned days)
-{
-    jsErrCode error{};
-    jsStreamInfo *info = nullptr;
-    const natsStatus there = js_GetStreamInfo(&info, session.stream.get(), kLogStream, nullptr, &error);
-    jsStreamInfo_Destroy(info);
-    if (there == NATS_OK)
-        return true;
-    const char *subjects[] = {"vex.log.>"};
-    jsStreamConfig config;
-    jsStreamConfig_Init(&config);
-    config.Name = kLogStream;
-    config.Subjects = subjects;
-    config.SubjectsLen = 1;
-    config.Replicas = kReplicas;
-    config.Duplicates = kDuplicates * kSecond;
-    config.MaxAge = int64_t{86400} * days * kSecond;
-    natsStatus status = js_AddStream(nullptr, session.stream.get(), &config, nullptr, &error);
-    if (status != NATS_OK && error == kNotClustered) {
-        config.Replicas = 1;
-        status = js_AddStream(nullptr, session.stream.get(), &config, nullptr, &error);
-    }
-    return status == NATS_OK;
+    nats_make_replicated([&](int replicas) {
+        config.Replicas = replicas;
+        return js_CreateKeyValue(&made, session.stream.get(), &config);
+    });
+    return nats_bucket_ptr(made);
 }
 
 /* Whether a bucket has answered, whatever it was, and not just the question been lost. */
@@ -74,20 +41,16 @@ bool is_final(natsStatus status)
            status == NATS_INVALID_ARG;
 }
 
-/* A key's value; none when it has none, or nobody answers. */
-std::optional<std::string> value_of(kvStore *store, const std::string &key, std::atomic<bool> &answers)
+/* What a bucket says of a key. */
+natsStatus look_up(kvStore *store, const std::string &key, std::string &value)
 {
-    if (!answers)
-        return std::nullopt;
     kvEntry *found = nullptr;
     const natsStatus status = kvStore_Get(&found, store, key.c_str());
     const nats_entry_ptr owned(found);
-    if (status != NATS_OK) {
-        answers = answers && is_final(status);
-        return std::nullopt;
-    }
-    return std::string(static_cast<const char *>(kvEntry_Value(found)),
-                       static_cast<std::size_t>(kvEntry_ValueLen(found)));
+    if (status == NATS_OK)
+        value.assign(static_cast<const char *>(kvEntry_Value(found)),
+                     static_cast<std::size_t>(kvEntry_ValueLen(found)));
+    return status;
 }
 
 } // namespace
@@ -130,17 +93,16 @@ void directory::touch_all()
     changed_.set();
 }
 
-/* Makes what is needed of JetStream; nothing, when that does not answer. */
+/* Makes the buckets; nothing, when that does not answer. */
 task<std::shared_ptr<directory::buckets>> directory::prepare()
 {
     using result = std::shared_ptr<buckets>;
-    const unsigned days = home_.options.store_days;
-    std::function<result(nats_session &)> make = [days](nats_session &session) {
+    std::function<result(nats_session &)> make = [](nats_session &session) {
         auto made = std::make_shared<buckets>();
         made->servers = bucket(session, "vex_servers", kForget);
         if (made->servers != nullptr)
             made->devices = bucket(session, "vex_devices", kForgetDevice);
-        return made->devices != nullptr && has_log_stream(session, days) ? made : nullptr;
+        return made->devices != nullptr ? made : nullptr;
     };
     co_return co_await link_.run<result>(std::move(make));
 }
@@ -151,14 +113,11 @@ task<void> directory::stay_alive()
     asio::steady_timer timer(home_.io);
     auto refreshed = server_clock::now();
     for (asio::error_code cancelled; !cancelled;) {
-        if (buckets_ != nullptr && !buckets_->answer)
-            buckets_.reset();
         if (buckets_ == nullptr && link_.connected()) {
             auto made = co_await prepare();
             if (made != nullptr && link_.connected()) {
                 buckets_ = std::move(made);
                 touch_all();
-                ready_();
             } else if (!std::exchange(told_, true)) {
                 server_log("JetStream does not answer", {});
             }
@@ -200,8 +159,8 @@ task<void> directory::write_changes()
             std::function<std::vector<update>(nats_session &)> write = [into = buckets_, name = home_.name,
                                                                         updates = next_updates()](nats_session &) {
                 std::vector<update> done = updates;
-                for (update &each : done)
-                    write_one(*into, name, each);
+                for (auto each = done.begin(); each != done.end() && write_one(*into, name, *each); ++each) {
+                }
                 return done;
             };
             const std::vector<update> done = co_await link_.run<std::vector<update>>(std::move(write));
@@ -215,31 +174,30 @@ task<void> directory::write_changes()
     }
 }
 
-/* Writes where a device is, or that it has left, unless another server has written about it since. */
-void directory::write_one(buckets &into, const std::string &name, update &update)
+/* Writes where a device is, or that it has left, unless another server has written about it since. False when nobody
+ * answers: the rest would wait in vain, too. */
+bool directory::write_one(const buckets &into, const std::string &name, update &update)
 {
     kvStore *const devices = into.devices.get();
     const char *const key = update.imei.c_str();
     if (!update.what.there) {
-        const natsStatus status = update.what.revision == 0
-                                      ? NATS_OK
-                                      : kvStore_UpdateString(nullptr, devices, key, "{}", update.what.revision);
-        update.written = is_final(status);
-        return;
+        update.written = update.what.revision == 0 ||
+                         is_final(kvStore_UpdateString(nullptr, devices, key, "{}", update.what.revision));
+        return update.written;
     }
-    const std::optional<std::string> before = value_of(devices, update.imei, into.answer);
-    if (!into.answer)
-        return;
-    const message other(before.value_or(""));
+    std::string before;
+    std::string ignored;
+    if (!is_final(look_up(devices, update.imei, before)))
+        return false;
+    const message other(before);
     const std::string server = other.text("server");
-    if (!server.empty() && server != name &&
-        std::strtoll(other.text("since").c_str(), nullptr, 10) > update.what.since &&
-        value_of(into.servers.get(), server, into.answer)) {
-        update.written = update.is_elsewhere = true;
-        return;
-    }
+    const bool is_newer = std::strtoll(other.text("since").c_str(), nullptr, 10) > update.what.since;
+    update.is_elsewhere =
+        !server.empty() && server != name && is_newer && look_up(into.servers.get(), server, ignored) == NATS_OK;
     const std::string value = tool_json({{"server", name}, {"since", std::to_string(update.what.since)}});
-    update.written = kvStore_PutString(&update.what.revision, devices, key, value.c_str()) == NATS_OK;
+    update.written =
+        update.is_elsewhere || kvStore_PutString(&update.what.revision, devices, key, value.c_str()) == NATS_OK;
+    return update.written;
 }
 
 /* Notes what came of updates; false when some have to be written once more. */
@@ -263,37 +221,20 @@ bool directory::note(const std::vector<update> &updates)
     return all;
 }
 
-task<std::optional<server_place>> directory::find(std::string imei)
+task<std::optional<std::vector<std::string>>> directory::others()
 {
-    using result = std::optional<server_place>;
-    if (buckets_ == nullptr)
-        co_return result();
-    std::function<result(nats_session &)> look = [from = buckets_, imei, own = home_.name](nats_session &) {
-        const std::string name = message(value_of(from->devices.get(), imei, from->answer).value_or("")).text("server");
-        const auto tools =
-            name.empty() || name == own ? std::nullopt : value_of(from->servers.get(), name, from->answer);
-        return tools ? result({name, *tools}) : std::nullopt;
-    };
-    co_return co_await link_.run<result>(std::move(look));
-}
-
-task<std::vector<server_place>> directory::others()
-{
-    using result = std::vector<server_place>;
+    using result = std::optional<std::vector<std::string>>;
     if (buckets_ == nullptr)
         co_return result();
     std::function<result(nats_session &)> look = [from = buckets_, own = home_.name](nats_session &) {
-        result found;
         kvKeysList keys{};
-        for (int tries = 0; kvStore_Keys(&keys, from->servers.get(), nullptr) != NATS_OK; ++tries)
+        for (int tries = 1; kvStore_Keys(&keys, from->servers.get(), nullptr) != NATS_OK; ++tries)
             if (tries == kKeysTries)
-                return found;
-        for (int i = 0; i < keys.Count; ++i)
-            if (const auto tools =
-                    keys.Keys[i] != own ? value_of(from->servers.get(), keys.Keys[i], from->answer) : std::nullopt)
-                found.push_back({keys.Keys[i], *tools});
+                return result();
+        std::vector<std::string> found(keys.Keys, keys.Keys + keys.Count);
         kvKeysList_Destroy(&keys);
-        return found;
+        std::erase(found, own);
+        return result(std::move(found));
     };
     co_return co_await link_.run<result>(std::move(look));
 }

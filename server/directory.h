@@ -1,6 +1,6 @@
 /*
- * Where the devices of all servers are: two buckets of JetStream's that every server writes and reads. An entry of the one
- * says which server has a device; one of the other, how tools reach a server, and is gone 15 seconds after that died.
+ * Where the devices of all servers are, for anybody to read: two buckets of JetStream's. An entry of the one says which
+ * server has a device; one of the other, how tools reach a server, and is gone 15 seconds after that died.
  */
 #ifndef SERVER_DIRECTORY_H
 #define SERVER_DIRECTORY_H
@@ -8,8 +8,6 @@
 #include "server/nats_link.h"
 #include "server/server.h"
 
-#include <atomic>
-#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -17,20 +15,10 @@
 #include <string>
 #include <vector>
 
-/* A server that has a device, or just a server. */
-struct server_place {
-    std::string name;
-    std::string tools; /* the address at which tools reach it */
-};
-
 class directory
 {
 public:
-    /* `ready` is called whenever JetStream has all that the servers need of it. */
-    directory(server &server, nats_link &link, std::function<void()> ready)
-        : home_(server), link_(link), ready_(std::move(ready)), changed_(server.io)
-    {
-    }
+    directory(server &server, nats_link &link) : home_(server), link_(link), changed_(server.io) {}
 
     /* Begins to keep it up to date. */
     void start();
@@ -40,17 +28,14 @@ public:
     void enter(const std::string &imei, std::time_t since);
     void leave(const std::string &imei);
 
-    /* The other server that has a device, if there is one that lives. */
-    task<std::optional<server_place>> find(std::string imei);
-    /* All other servers that live. */
-    task<std::vector<server_place>> others();
+    /* The names of all other servers that live; none when nobody says. */
+    task<std::optional<std::vector<std::string>>> others();
     /* Writes what is not written yet, and that this server is gone; no longer than a second. */
     task<void> end();
 
 private:
     struct buckets {
         nats_bucket_ptr servers, devices;
-        std::atomic<bool> answer = true; /* or else nobody waits for them any more: others are made */
     };
     struct presence {
         std::time_t since = 0;
@@ -69,13 +54,12 @@ private:
     task<void> stay_alive();
     task<std::shared_ptr<buckets>> prepare();
     bool note(const std::vector<update> &updates);
-    static void write_one(buckets &into, const std::string &name, update &update);
+    static bool write_one(const buckets &into, const std::string &name, update &update);
     std::vector<update> next_updates();
     void touch_all();
 
     server &home_;
     nats_link &link_;
-    const std::function<void()> ready_;
     std::shared_ptr<buckets> buckets_; /* none, until they can be used */
     std::map<std::string, presence> here_;
     std::set<std::string> changes_; /* IMEIs */

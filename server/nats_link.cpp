@@ -7,15 +7,16 @@ namespace
 
 using namespace std::chrono_literals;
 
-/* All in ms. */
+/* What the library waits for, in ms. */
 constexpr int64_t kConnectMax = 2000;
 constexpr int64_t kWriteMax = 5000;
 constexpr int64_t kPing = 5000; /* twice without an answer, and the connection is lost */
 constexpr int64_t kReconnect = 500;
-constexpr int64_t kAskMax = 2000;         /* for JetStream to answer: devices wait for it that call */
+constexpr int64_t kAskMax = 2000;         /* for JetStream to answer */
 constexpr int64_t kAcknowledgeMax = 5000; /* for it to keep a record */
-constexpr auto kAgainAfter = 5s;          /* when the library has given up: it was refused twice, say */
-constexpr unsigned kWaitingMost = 20000;  /* jobs, and messages: what comes beyond them is lost */
+
+constexpr auto kAgainAfter = 5s;         /* when the library has given up: it was refused twice, say */
+constexpr unsigned kWaitingMost = 20000; /* jobs, and messages: what comes beyond them is lost */
 
 } // namespace
 

@@ -43,6 +43,16 @@ struct nats_session {
     nats_stream_ptr stream;
 };
 
+/* Makes something of JetStream's with three replicas, or one where NATS is no cluster; whether it is there. While a cluster
+ * is not complete it is not. */
+template <class Make> bool nats_make_replicated(Make make)
+{
+    if (make(3) == NATS_OK)
+        return true;
+    const bool is_alone = std::string(nats_GetLastError(nullptr)).find("non-clustered") != std::string::npos;
+    return is_alone && make(1) == NATS_OK;
+}
+
 struct nats_message {
     std::string subject, reply, data;
 };

@@ -1,5 +1,7 @@
 #include "server/spool.h"
 
+#include "server/fleet.h"
+
 #include <filesystem>
 
 namespace fs = std::filesystem;
@@ -9,6 +11,8 @@ namespace
 
 using namespace std::chrono_literals;
 
+constexpr char kStream[] = "vex_log";
+
 constexpr auto kFlushEach = 200ms;
 constexpr auto kAgainAfter = 1s;
 constexpr auto kAskAgainAfter = 3s;     /* longer than an answer takes */
@@ -16,6 +20,8 @@ constexpr auto kSettleMax = 15s;        /* for a record, by which time the libra
 constexpr auto kTellEach = 10s;         /* that records fail */
 constexpr int64_t kLookMax = 2000;      /* ms, for the bus to say what it has */
 constexpr unsigned kUnderWayMost = 256; /* records: a few MB */
+constexpr int64_t kSecond = 1'000'000'000;
+constexpr int64_t kDuplicates = 300 * kSecond; /* for which JetStream knows a record that comes twice */
 
 /* What JetStream has last of a subject. */
 struct last_record {
@@ -31,12 +37,12 @@ last_record look_up_last(nats_session &session, const std::string &subject)
     options.Wait = kLookMax;
     natsMsg *message = nullptr;
     const natsStatus status =
-        js_GetLastMsg(&message, session.stream.get(), kLogStream, subject.c_str(), &options, nullptr);
+        js_GetLastMsg(&message, session.stream.get(), kStream, subject.c_str(), &options, nullptr);
     const nats_message_ptr owned(message);
     last_record last{status == NATS_OK || status == NATS_NOT_FOUND, "", 0};
     const char *id = nullptr;
     if (status == NATS_OK) {
-        last.time = static_cast<std::time_t>(natsMsg_GetTime(message) / 1'000'000'000);
+        last.time = static_cast<std::time_t>(natsMsg_GetTime(message) / kSecond);
         if (natsMsgHeader_Get(message, kMessageId, &id) == NATS_OK)
             last.id = id;
     }
@@ -52,6 +58,28 @@ task<last_record> last_of(nats_link &link, std::string subject)
     co_return co_await link.run<last_record>(std::move(look));
 }
 
+/* Makes the stream unless it is there. */
+bool has_stream(nats_session &session, unsigned days)
+{
+    jsStreamInfo *info = nullptr;
+    const natsStatus there = js_GetStreamInfo(&info, session.stream.get(), kStream, nullptr, nullptr);
+    jsStreamInfo_Destroy(info);
+    if (there == NATS_OK)
+        return true;
+    const char *subjects[] = {"vex.log.>"};
+    jsStreamConfig config;
+    jsStreamConfig_Init(&config);
+    config.Name = kStream;
+    config.Subjects = subjects;
+    config.SubjectsLen = 1;
+    config.Duplicates = kDuplicates;
+    config.MaxAge = 86400 * kSecond * days;
+    return nats_make_replicated([&](int replicas) {
+        config.Replicas = replicas;
+        return js_AddStream(nullptr, session.stream.get(), &config, nullptr, nullptr);
+    });
+}
+
 } // namespace
 
 bool spool::open(std::string &why)
@@ -63,7 +91,8 @@ bool spool::open(std::string &why)
     for (fs::directory_iterator file(options.spool, error), end; !error && file != end; file.increment(error)) {
         const std::string name = file->path().filename();
         const std::size_t dot = std::min(name.find('.'), name.size() - 1);
-        if (const auto kind = log_kind_of(name.substr(dot + 1)))
+        const auto kind = log_kind_of(name.substr(dot + 1));
+        if (kind && is_imei(name.substr(0, dot)))
             find(name.substr(0, dot), *kind).doubtful = true;
     }
     if (error) {
@@ -77,7 +106,7 @@ bool spool::open(std::string &why)
 spool::spooled &spool::find(const std::string &imei, log_kind kind)
 {
     const std::string subject = "vex.log." + imei + '.' + log_name(kind);
-    spooled &found = entries_[subject];
+    spooled &found = logs_[subject];
     if (found.stored != nullptr)
         return found;
     auto file = std::make_unique<spool_file>(room_, fs::path(home_.options.spool) / (imei + '.' + log_name(kind)));
@@ -103,23 +132,42 @@ task<void> spool::ask_for_past(spooled &log)
     const last_record last = co_await last_of(link_, log.subject);
     if (last.known && !log.past_is_known) {
         log.past_is_known = true;
-        log.stored->kept_last(last.time);
+        log.stored->kept_last(last.time, last.id.starts_with(log.name));
         log.not_before = {};
     }
     send_next(log);
 }
 
-void spool::set_ready(bool ready)
+void spool::set_connected(bool connected)
 {
-    ready_ = ready;
-    for (auto &[subject, log] : entries_)
-        if (ready)
-            send_next(log);
+    ready_ = false;
+    if (connected && !std::exchange(making_, true))
+        run_beside(home_.io, make_stream());
+}
+
+/* Sees to it that there is a stream, which may have to be waited for, and has the logs sent. */
+task<void> spool::make_stream()
+{
+    asio::steady_timer pause(home_.io);
+    while (!ready_ && link_.connected()) {
+        std::function<bool(nats_session &)> make = [days = home_.options.store_days](nats_session &session) {
+            return has_stream(session, days);
+        };
+        const bool made = co_await link_.run<bool>(std::move(make));
+        ready_ = made && link_.connected();
+        asio::error_code ignored;
+        pause.expires_after(kAgainAfter);
+        if (!ready_)
+            co_await pause.async_wait(await_into(ignored));
+    }
+    making_ = false;
+    for (auto &[subject, log] : logs_)
+        send_next(log);
 }
 
 void spool::flush()
 {
-    for (auto &[subject, log] : entries_)
+    for (auto &[subject, log] : logs_)
         log.file->flush();
 }
 
@@ -131,7 +179,7 @@ task<void> spool::tick()
         timer.expires_after(kFlushEach);
         co_await timer.async_wait(await_into(cancelled));
         const auto now = server_clock::now();
-        for (auto &[subject, log] : entries_) {
+        for (auto &[subject, log] : logs_) {
             if (log.file->has_waiting())
                 log.file->flush();
             if (!log.under_way.empty() && now > log.deadline)
@@ -191,8 +239,8 @@ task<void> spool::resolve(spooled &log, std::string id)
 
 void spool::kept(const std::string &subject, const std::string &id, const std::string &why)
 {
-    const auto found = entries_.find(subject);
-    if (found == entries_.end() || found->second.under_way != id)
+    const auto found = logs_.find(subject);
+    if (found == logs_.end() || found->second.under_way != id)
         return;
     if (!why.empty()) {
         failed(found->second, why);

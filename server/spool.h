@@ -13,11 +13,7 @@
 #include <deque>
 #include <map>
 #include <memory>
-#include <set>
 #include <string>
-
-/* The stream of JetStream that has the logs. */
-constexpr char kLogStream[] = "vex_log";
 
 class spool
 {
@@ -31,7 +27,7 @@ public:
     std::uint64_t total() const { return room_.total; }
 
     /* The bus is there, or not. */
-    void set_ready(bool ready);
+    void set_connected(bool connected);
     /* What came of a record. */
     void kept(const std::string &subject, const std::string &id, const std::string &why);
     /* Writes what was taken. */
@@ -52,6 +48,7 @@ private:
     };
 
     spooled &find(const std::string &imei, log_kind kind);
+    task<void> make_stream();
     task<void> tick();
     void send_next(spooled &log);
     task<void> resolve(spooled &log, std::string id);
@@ -62,10 +59,11 @@ private:
     server &home_;
     nats_link &link_;
     spool_room room_;
-    std::map<std::string, spooled> entries_; /* by subject */
+    std::map<std::string, spooled> logs_; /* by subject */
     std::deque<spooled *> waiting_;
     unsigned under_way_ = 0;
-    bool ready_ = false;
+    bool ready_ = false; /* JetStream has the stream */
+    bool making_ = false;
     server_clock::time_point told_{}; /* that records fail */
 };
 

@@ -74,7 +74,7 @@ void spool_file::recover()
     }
     room_.total += end_ - head_;
     if (head_ == end_)
-        remove_oldest();
+        remove_file();
 }
 
 void spool_file::append(std::string_view bytes)
@@ -128,8 +128,7 @@ std::optional<spool_record> spool_file::oldest()
     lost_ += end_ - head_;
     why_lost_ = "the spool cannot be read";
     room_.total -= end_ - head_;
-    head_ = end_;
-    remove_oldest();
+    remove_file();
     return std::nullopt;
 }
 
@@ -140,10 +139,14 @@ void spool_file::remove_oldest()
         head_ += sizeof head + head.size;
         room_.total -= sizeof head + head.size;
     }
-    if (head_ < end_) {
+    if (head_ < end_)
         static_cast<void>(!pwrite(fd_.get(), &head_, sizeof head_, 0)); /* else it is sent twice, and taken once */
-        return;
-    }
+    else
+        remove_file();
+}
+
+void spool_file::remove_file()
+{
     std::error_code ignored;
     fs::remove(path_, ignored);
     fd_.reset();

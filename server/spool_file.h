@@ -49,6 +49,7 @@ public:
 private:
     bool open();
     void recover();
+    void remove_file();
     void lose(std::string_view bytes, std::string why);
 
     spool_room &room_;

@@ -99,13 +99,13 @@ void stored_log::interrupted(const live_log *source, const std::string &why)
     output_->close(); /* it may be for good */
 }
 
-void stored_log::kept_last(std::time_t when)
+void stored_log::kept_last(std::time_t when, bool ours)
 {
     past_is_known_ = true;
-    if (when > since_) {
-        since_ = when;
+    if (!ours && when > since_)
         why_ = "the device was not with this server";
-    }
+    if (!ours || since_ == 0)
+        since_ = std::max(since_, when);
     if (source_ != nullptr)
         tell_gap();
 }

@@ -45,8 +45,8 @@ public:
 
     /* What came before is about to be found out: what is missing is told when it is. */
     void await_past() { past_is_known_ = false; }
-    /* When something of it was kept last by whatever server; 0: never. */
-    void kept_last(std::time_t when);
+    /* When something of it was kept last; 0: never. `ours`: by this server, or one before it of the same name. */
+    void kept_last(std::time_t when, bool ours);
     void append(std::string_view bytes);
     /* The log has begun again, from that source; it has ended, unless another source has begun meanwhile. What is missing
      * in between is told. */

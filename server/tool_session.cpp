@@ -61,24 +61,28 @@ task<bool> begin_log(tool_session &tool, const std::string &reply)
 
 constexpr char kDevicesHead[] = R"({"msgid":"devices","Result":"Success"})";
 
-/* The devices of this server and of all others, a line each, in the data parts of as many frames as it takes. */
+/* The devices of this server and of all others, a line each, in the data parts of as many frames as it takes, and one
+ * without data behind them, which says what is missing. */
 task<std::vector<std::string>> device_frames(server &home)
 {
     std::string lines;
     for (const auto &[imei, device] : home.devices->all())
         lines += device->describe("there") + '\n';
+    std::string missing;
     if (home.bus)
-        lines += co_await home.bus->list();
+        lines += co_await home.bus->list(missing);
     std::vector<std::string> frames;
     for (std::size_t at = 0, end = 0; at < lines.size(); at = end) {
         end = lines.size() - at <= kPkgDataMax ? lines.size() : lines.rfind('\n', at + kPkgDataMax - 1) + 1;
         frames.push_back(make_frame(kDevicesHead, std::string_view(lines).substr(at, end - at)));
     }
+    const std::string result =
+        missing.empty() ? "Success" : "Fail:these are not all: it does not know those " + missing;
+    frames.push_back(make_frame(tool_json({{"msgid", "devices"}, {"Result", result}})));
     co_return frames;
 }
 
-/* Tells all devices, with a frame without data behind them; then, if that is wanted, who calls and who leaves until the
- * tool has enough. */
+/* Tells all devices; then, if that is wanted, who calls and who leaves until the tool has enough. */
 task<void> list_devices(tool_session &tool, bool watch)
 {
     std::deque<std::string> changes;
@@ -90,8 +94,7 @@ task<void> list_devices(tool_session &tool, bool watch)
     const auto watching = tool.home.devices->watch(
         [&](const device &device, bool there) { note(device.describe(there ? "called" : "left")); });
     const auto watching_others = watch && tool.home.bus ? tool.home.bus->watch(note) : nullptr;
-    std::vector<std::string> frames = co_await device_frames(tool.home);
-    frames.push_back(make_frame(kDevicesHead));
+    const std::vector<std::string> frames = co_await device_frames(tool.home);
     for (const std::string &frame : frames) {
         const bool said = co_await say(tool, frame);
         if (!said)

@@ -100,6 +100,20 @@ bool is_local(const std::string &address)
     return address.find('/') != std::string::npos;
 }
 
+/* Why a server has not done what it was asked. */
+std::string refusal(const std::string &result)
+{
+    return "the log server says: " + tool_printable(result.starts_with("Fail:") ? result.substr(5) : result);
+}
+
+/* What a frame of a list of devices says is missing; empty: nothing. */
+std::string missing_of(const tool_frame &frame)
+{
+    const json_tree root{cJSON_ParseWithLength(frame.control.data(), frame.control.size())};
+    const std::string result = text_of(root.get(), "Result");
+    return result.starts_with("Fail:") ? refusal(result) : "";
+}
+
 /* Asks one server; `elsewhere`: the one that it knows to have the device. */
 std::optional<tool_link> ask_one(const tool_server &server, const tool_limits &limits, const tool_members &request,
                                  tool_frame &answer, std::string &elsewhere, std::string &why)
@@ -124,7 +138,7 @@ std::optional<tool_link> ask_one(const tool_server &server, const tool_limits &l
             return std::nullopt;
         }
         if (result != "Waiting") {
-            why = "the log server says: " + tool_printable(result.starts_with("Fail:") ? result.substr(5) : result);
+            why = refusal(result);
             return std::nullopt;
         }
         std::fprintf(stderr, "Waiting: %s.\n", tool_printable(text_of(root.get(), "reason")).c_str());
@@ -157,8 +171,10 @@ std::optional<std::vector<tool_entry>> tool_list_devices(const tool_server &serv
     tool_frame frame;
     std::optional<tool_link> link = tool_ask_server(server, limits, {{"msgid", "devices"}}, frame, why);
     while (link) {
-        if (frame.data.empty())
-            return all;
+        if (frame.data.empty()) {
+            why = missing_of(frame);
+            return why.empty() ? std::optional(std::move(all)) : std::nullopt;
+        }
         for (tool_entry &entry : entries(frame))
             all.push_back(std::move(entry));
         const std::optional<tool_frame> next = tool_receive(*link, limits.stall, why);
@@ -186,8 +202,11 @@ int tool_devices(const tool_server &server, const tool_limits &limits, bool json
         for (tool_entry &entry : entries(frame))
             show(entry, json);
         std::fflush(stdout);
+        const std::string missing = missing_of(frame);
         if (frame.data.empty() && !watch)
-            return kDone;
+            return missing.empty() ? kDone : tool_fail(kNoAnswer, missing);
+        if (!missing.empty())
+            std::fprintf(stderr, "%s\n", missing.c_str());
         const std::optional<tool_frame> next = tool_receive(*link, watch ? kForEver : limits.stall, why);
         if (!next)
             return tool_interrupted() ? kDone : tool_fail(kNoAnswer, why);
