@@ -53,7 +53,7 @@ void keep_freed_memory() {}
 #endif
 
 /* A starter may have blocked signals or ignored them, which programs inherit: SIGTERM has to end them and this process, and
- * SIGCHLD to tell how they end. SIGHUP is left as it is: nohup ignores it on purpose. */
+ * SIGCHLD to tell how they end. SIGHUP is left as it is, for the maker's log and nohup. */
 void take_signals()
 {
     sigset_t none;

@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <cerrno>
+#include <csignal>
 #include <ctime>
 #include <fcntl.h>
 #include <filesystem>
@@ -168,6 +169,18 @@ TEST_F(HostPlatform, NvItemsAreOldOrNewWhenKilled)
             stored[i] = now;
         }
     }
+}
+
+TEST_F(HostPlatform, LogGoesOnInANewFileAfterHangup)
+{
+    const auto lines = [this](const char *file) { return run_command("sed 's/.* //' " + dir_ + '/' + file); };
+    vex_syslog_append(6, "test", 1, 0, "before\n");
+    std::filesystem::rename(dir_ + "/log", dir_ + "/log.1");
+    vex_syslog_append(6, "test", 1, 0, "moved\n");
+    raise(SIGHUP);
+    vex_syslog_append(6, "test", 1, 0, "after\n");
+    EXPECT_EQ("before\nmoved\n", lines("log.1"));
+    EXPECT_EQ("after\n", lines("log"));
 }
 
 TEST_F(HostPlatform, LogLinesAreLinesWhateverTheyHold)

@@ -5,6 +5,7 @@
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
@@ -28,6 +29,8 @@ struct log_file {
 std::atomic<unsigned long> g_lost{0}; /* lines, since the last that was written */
 std::atomic<bool> g_cut{false};       /* whether the last was written in part */
 
+std::atomic<bool> g_reopen{false}; /* its file, which has been moved away */
+
 /* Its socket, which several threads may open again. Never destroyed: threads may log while the process exits. */
 std::mutex g_socket_lock;
 int g_socket = -1;
@@ -40,12 +43,32 @@ int open_path(const char *path)
     return fd == -1 && errno == ENXIO ? open(path, O_RDWR | kFlags) : fd;
 }
 
+void on_hangup(int /*signal*/)
+{
+    g_reopen = true;
+}
+
+/* Unless it is ignored, as by nohup. */
+void reopen_on_hangup()
+{
+    struct sigaction action {
+    };
+    sigaction(SIGHUP, nullptr, &action);
+    if (action.sa_handler == SIG_IGN)
+        return;
+    action.sa_handler = on_hangup;
+    action.sa_flags = SA_RESTART;
+    sigaction(SIGHUP, &action, nullptr);
+}
+
 log_file open_file()
 {
     const char *path = std::getenv("VEX_LOG_FILE");
     const int fd = path != nullptr && *path != '\0' ? open_path(path) : -1;
     struct stat status {
     };
+    if (fd != -1)
+        reopen_on_hangup();
     const bool pipe = fd != -1 && fstat(fd, &status) == 0 && S_ISFIFO(status.st_mode);
     return {fd, pipe ? std::size_t{PIPE_BUF} : std::size_t{INT_MAX}};
 }
@@ -56,8 +79,18 @@ const log_file &file()
     return opened;
 }
 
+/* Goes on in a new file under the old name, and the same descriptor: other threads may be writing to that. */
+void reopen()
+{
+    const unique_fd again{open_path(std::getenv("VEX_LOG_FILE"))};
+    if (again)
+        dup3(again.get(), file().fd, O_CLOEXEC);
+}
+
 bool write_to_file(std::string_view line)
 {
+    if (g_reopen.load(std::memory_order_relaxed) && g_reopen.exchange(false))
+        reopen();
     if (line.size() > file().line_max)
         return false;
     const ssize_t n = write(file().fd, line.data(), line.size());
