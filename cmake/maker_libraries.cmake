@@ -1,0 +1,16 @@
+# Sees to it that the maker's libraries have every call that the daemon makes.
+include(CheckCXXSymbolExists)
+set(CMAKE_REQUIRED_INCLUDES ${PROJECT_SOURCE_DIR})
+set(CMAKE_REQUIRED_LIBRARIES ${VEX_PLATFORM_LIBS})
+foreach(call vex_syslog_append vex_nvconfig_read vex_nvconfig_write cfg_save vex_msg_send)
+  unset(has_${call} CACHE) # the libraries may be others than last time
+  check_cxx_symbol_exists(${call} platform/vex_platform.h has_${call})
+  if(NOT has_${call})
+    string(APPEND missing_calls " ${call}")
+  endif()
+endforeach()
+if(missing_calls)
+  message(FATAL_ERROR "VEX_PLATFORM_LIBS lacks:${missing_calls}")
+endif()
+unset(CMAKE_REQUIRED_INCLUDES)
+unset(CMAKE_REQUIRED_LIBRARIES)
