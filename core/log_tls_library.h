@@ -1,6 +1,6 @@
 /*
  * OpenSSL, loaded when client mode begins. Server mode, which has no use for it, is thereby spared the megabyte that
- * the library takes up by being there. Only calls that version 1.1 has too.
+ * the library takes up by being there. A build may link it instead. Only calls that version 1.1 has too.
  */
 #ifndef CORE_LOG_TLS_LIBRARY_H
 #define CORE_LOG_TLS_LIBRARY_H

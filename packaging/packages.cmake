@@ -19,7 +19,9 @@ set(CPACK_DEBIAN_DAEMON_PACKAGE_NAME vex-log-manage)
 set(CPACK_DEBIAN_DAEMON_PACKAGE_SECTION admin)
 set(CPACK_COMPONENT_DAEMON_DESCRIPTION
   "control and collection of a device's diagnostic logs\nRuns on the device and serves a log tool, or calls its log server.")
-set(CPACK_DEBIAN_DAEMON_PACKAGE_DEPENDS libssl3) # which it loads by name
+if(NOT VEX_TLS_LINKED)
+  set(CPACK_DEBIAN_DAEMON_PACKAGE_DEPENDS libssl3) # which it loads by name
+endif()
 set(CPACK_DEBIAN_DAEMON_PACKAGE_CONTROL_EXTRA ${PROJECT_SOURCE_DIR}/packaging/debian/postinst
   ${PROJECT_SOURCE_DIR}/packaging/debian/prerm)
 
